@@ -1,0 +1,17 @@
+#!/usr/bin/env bash
+# Installs what the build and the tests need from Debian's packages, when it is
+# missing. Safe to run again.
+set -euo pipefail
+
+packages=(g++ cmake make pkg-config zlib1g-dev libicu-dev libasio-dev libgtest-dev libgmock-dev
+          libbenchmark-dev openjdk-17-jdk-headless)
+missing=()
+for p in "${packages[@]}"; do
+  dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
+done
+if [ ${#missing[@]} -gt 0 ]; then
+  echo "installing: ${missing[*]}"
+  export DEBIAN_FRONTEND=noninteractive
+  apt-get update -qq
+  apt-get install -y -qq --no-install-recommends "${missing[@]}" >/dev/null
+fi
