@@ -264,6 +264,9 @@ DPX_API uint32_t dpx_rpc_unregister(void);
 
 #define DPX_HUB_LEN 100
 
+/* The interface UUID under which a hub stands in its host's location broker. */
+#define DPX_HUB_LB_UUID "684152a852f9.02.c6.d2.2d.fd.00.00.00"
+
 DPX_API extern handle_t BINDING_HANDLE;
 DPX_API extern unsigned char BINDING_HANDLE_INVALID;
 DPX_API extern char HUB[DPX_HUB_LEN];

@@ -1,0 +1,199 @@
+// dpx-agentd: hosts libdpx as a service. Brings up the RPC server on an
+// address, starts the library, serves the depot until SIGTERM or SIGINT.
+#include "dpx/dpx.h"
+
+#include "afw/afw.h"
+#include "ncs/lb.h"
+#include "ncs/server.h"
+
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <pthread.h>
+#include <string>
+
+namespace {
+
+const char kUsage[] =
+    "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub] [--broker]\n"
+    "\n"
+    "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
+    "\n"
+    "  --depot DIR         depot root (sets DPX_DEPOTROOT for the library)\n"
+    "  --product NAME      product name; files are served below DIR/NAME\n"
+    "  --listen HOST:PORT  address to listen on (default 127.0.0.1 and a free port)\n"
+    "  --threads N         threads that run calls (default 8)\n"
+    "  --hub               register this server in the host's location broker as the hub,\n"
+    "                      so that clients whose hub is this host find it\n"
+    "  --broker            run the location broker inside this process, on the broker port\n"
+    "  --help              this text\n"
+    "\n"
+    "When ready it prints one line \"listening on HOST:PORT\" on standard output.\n"
+    "It logs to standard error. SIGTERM or SIGINT stop it: calls under way finish.\n"
+    "\n"
+    "Environment:\n"
+    "  NCS_LB_PORT             port of the location broker (default 135)\n"
+    "  NCS_MAX_CONNECTIONS     connections served at once (default 256)\n"
+    "  NCS_IDLE_TIMEOUT_S      idle connections are closed after this (default 300)\n"
+    "  NCS_CALL_TIMEOUT_MS     time-out of one call on a connection (default 120000)\n"
+    "  DPX_MAX_RETRY           tries of a call on a busy peer (default 6)\n"
+    "  DPX_MIN_RETRY_INTERVAL  first sleep in seconds after a busy answer (default 3)\n"
+    "  TRC1_FLAGS, TRC1_FILE   tracing: flag mask (0x01 flow, 0x40 entry/exit, 0x80 errors)\n"
+    "                          and the file to append to (default standard error)\n";
+
+struct Options {
+    std::string depot;
+    std::string product;
+    std::string host = "127.0.0.1";
+    uint32_t port = 0;
+    uint32_t threads = 8;
+    bool hub = false;
+    bool broker = false;
+};
+
+int usage_error(const char *message)
+{
+    std::fprintf(stderr, "dpx-agentd: %s\n%s", message, kUsage);
+    return 2;
+}
+
+bool parse_listen(const std::string &text, Options &options)
+{
+    size_t colon = text.rfind(':');
+    if (colon == std::string::npos)
+        return false;
+    std::string host = text.substr(0, colon);
+    if (host.size() >= 2 && host.front() == '[' && host.back() == ']')
+        host = host.substr(1, host.size() - 2);
+    char *end = nullptr;
+    unsigned long port = std::strtoul(text.c_str() + colon + 1, &end, 10);
+    if (host.empty() || end == text.c_str() + colon + 1 || *end != '\0' || port > 65535)
+        return false;
+    options.host = host;
+    options.port = static_cast<uint32_t>(port);
+    return true;
+}
+
+void log_line(const char *what, uint32_t status)
+{
+    char text[256];
+    error__c_text(status, text, sizeof text);
+    std::fprintf(stderr, "dpx-agentd: %s: 0x%08x %s\n", what, status, text);
+}
+
+}  // namespace
+
+int main(int argc, char **argv)
+{
+    Options options;
+    for (int i = 1; i < argc; ++i) {
+        std::string arg = argv[i];
+        auto value = [&](const char *name) -> const char * {
+            if (i + 1 >= argc) {
+                std::fprintf(stderr, "dpx-agentd: %s needs a value\n", name);
+                return nullptr;
+            }
+            return argv[++i];
+        };
+        if (arg == "--help" || arg == "-h") {
+            std::fputs(kUsage, stdout);
+            return 0;
+        } else if (arg == "--depot") {
+            const char *v = value("--depot");
+            if (v == nullptr)
+                return 2;
+            options.depot = v;
+        } else if (arg == "--product") {
+            const char *v = value("--product");
+            if (v == nullptr)
+                return 2;
+            options.product = v;
+        } else if (arg == "--listen") {
+            const char *v = value("--listen");
+            if (v == nullptr || !parse_listen(v, options))
+                return usage_error("--listen wants HOST:PORT");
+        } else if (arg == "--threads") {
+            const char *v = value("--threads");
+            char *end = nullptr;
+            unsigned long n = v != nullptr ? std::strtoul(v, &end, 10) : 0;
+            if (v == nullptr || *end != '\0' || n == 0 || n > 1024)
+                return usage_error("--threads wants a number from 1 to 1024");
+            options.threads = static_cast<uint32_t>(n);
+        } else if (arg == "--hub") {
+            options.hub = true;
+        } else if (arg == "--broker") {
+            options.broker = true;
+        } else {
+            return usage_error(("unknown argument " + arg).c_str());
+        }
+    }
+    if (options.depot.empty() || options.product.empty())
+        return usage_error("--depot and --product are required");
+
+    // The signals are taken by sigwait below; every thread inherits the mask.
+    sigset_t stop_signals;
+    sigemptyset(&stop_signals);
+    sigaddset(&stop_signals, SIGTERM);
+    sigaddset(&stop_signals, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
+    std::signal(SIGPIPE, SIG_IGN);
+
+    setenv("DPX_DEPOTROOT", options.depot.c_str(), 1);
+    AFW_SetProductName(options.product.c_str());
+
+    uint32_t status = rpc__s_ok;
+    if (options.broker) {
+        lb__start_broker(options.host.c_str(), &status);
+        if (status != rpc__s_ok) {
+            log_line("cannot start the location broker", status);
+            return 1;
+        }
+    }
+    socket__addr_t bound;
+    uint32_t bound_len = sizeof bound;
+    rpc__listen(options.host.c_str(), options.port, options.threads, &bound, &bound_len, &status);
+    if (status != rpc__s_ok) {
+        log_line("cannot listen", status);
+        if (options.broker)
+            lb__stop_broker();
+        return 1;
+    }
+    dpx_agent_init();
+
+    lb__entry_t entry;
+    std::memset(&entry, 0, sizeof entry);
+    if (options.hub) {
+        uuid__decode(DPX_HUB_LB_UUID, &entry.obj_interface, &status);
+        std::snprintf(entry.annotation, sizeof entry.annotation, "dpx hub %s", options.product.c_str());
+        entry.saddr = bound;
+        entry.saddr_len = bound_len;
+        lb__register(&entry, &status);
+        if (status != rpc__s_ok)
+            log_line("cannot register in the location broker", status);
+    }
+
+    char name[128] = "";
+    uint32_t name_len = sizeof name;
+    uint32_t port = 0;
+    socket__to_name(&bound, bound_len, name, &name_len, &port, &status);
+    bool v6 = std::strchr(name, ':') != nullptr;
+    std::printf("listening on %s%s%s:%u\n", v6 ? "[" : "", name, v6 ? "]" : "", port);
+    std::fflush(stdout);
+    std::fprintf(stderr, "dpx-agentd: serving %s/%s with %u threads%s%s\n", options.depot.c_str(),
+                 options.product.c_str(), options.threads, options.hub ? ", hub" : "",
+                 options.broker ? ", broker" : "");
+
+    int signal_number = 0;
+    sigwait(&stop_signals, &signal_number);
+    std::fprintf(stderr, "dpx-agentd: signal %d, stopping\n", signal_number);
+
+    if (options.hub)
+        lb__unregister(&entry, &status);
+    dpx_agent_stop();
+    rpc__stop_listening();
+    if (options.broker)
+        lb__stop_broker();
+    std::fprintf(stderr, "dpx-agentd: stopped\n");
+    return 0;
+}
