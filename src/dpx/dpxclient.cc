@@ -63,7 +63,9 @@ void call_with_retry(const trc::Scope &scope, const char *failure, dpx_status *s
 // it; a text of `width` characters or more keeps no terminator.
 void bounded_copy(char *field, const char *text, size_t width)
 {
-    std::strncpy(field, text, width);
+    size_t length = strnlen(text, width);
+    std::memcpy(field, text, length);
+    std::memset(field + length, 0, width - length);
 }
 
 // Steps 5 to 7 of a download, on the present buffer: one call, the checksum
