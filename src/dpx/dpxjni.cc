@@ -114,19 +114,17 @@ JNIEXPORT jobjectArray JNICALL Java_com_orvane_quill_flowgauge_core_ft_client_Fi
     jstring empty = env->NewStringUTF("");
     if (checkException(env))
         TRC1_ERROR_MSG("NewStringUTF failed.");
-    if (string_class == nullptr || empty == nullptr) {
-        if (string_class != nullptr)
-            env->DeleteLocalRef(string_class);
-        if (empty != nullptr)
-            env->DeleteLocalRef(empty);
-        release_chars(env, filter, f);
-        return nullptr;
-    }
 
-    if (ListNodes(f, &last, kNodeListMax, nodes) == DPX_OK && last >= 0) {
-        array = env->NewObjectArray(last + 1, string_class, empty);
-        if (checkException(env))
-            TRC1_ERROR_MSG("NewObjectArray failed.");
+    // Without the class or the initial element there is no array to give:
+    // the hub isn't asked.
+    if (string_class != nullptr && empty != nullptr) {
+        if (ListNodes(f, &last, kNodeListMax, nodes) == DPX_OK && last >= 0) {
+            array = env->NewObjectArray(last + 1, string_class, empty);
+            if (checkException(env))
+                TRC1_ERROR_MSG("NewObjectArray failed.");
+        }
+        // Element references are dropped one by one: a list of 128 names
+        // stays within the local references the JVM guarantees a native.
         for (int16_t i = 0; array != nullptr && i <= last; ++i) {
             // An entry keeps its terminator: at most 32 characters reach Java.
             char name[DPX_NODE_LEN];
@@ -142,14 +140,16 @@ JNIEXPORT jobjectArray JNICALL Java_com_orvane_quill_flowgauge_core_ft_client_Fi
                 env->DeleteLocalRef(element);
             }
         }
+        if (array == nullptr) {
+            array = env->NewObjectArray(0, string_class, empty);
+            if (checkException(env))
+                TRC1_ERROR_MSG("NewObjectArray failed.");
+        }
     }
-    if (array == nullptr) {
-        array = env->NewObjectArray(0, string_class, empty);
-        if (checkException(env))
-            TRC1_ERROR_MSG("NewObjectArray failed.");
-    }
-    env->DeleteLocalRef(string_class);
-    env->DeleteLocalRef(empty);
+    if (string_class != nullptr)
+        env->DeleteLocalRef(string_class);
+    if (empty != nullptr)
+        env->DeleteLocalRef(empty);
     release_chars(env, filter, f);
     return array;
 }
