@@ -52,9 +52,11 @@ extern "C" {
 #define lb__s_not_registered      0x1C030001u /* no (further) matching entry */
 #define lb__s_broker_unreachable  0x1C030002u
 #define lb__s_database_full       0x1C030003u
+#define lb__s_bad_argument        0x1C030004u /* an entry or argument the broker can't take */
 /* Sockets and UUIDs. */
 #define socket__s_bad_family      0x1C040001u
-#define socket__s_name_too_long   0x1C040002u
+#define socket__s_name_too_long   0x1C040002u /* the text doesn't fit the room given */
+#define socket__s_addr_too_small  0x1C040003u /* the address doesn't fit the room given */
 #define uuid__s_bad_text          0x1C050001u
 
 /* ---- UUIDs ------------------------------------------------------------- */
@@ -125,20 +127,29 @@ typedef union socket__addr_t {
  * network carrier. Its address holds nothing but the family. */
 #define socket__family_inproc 0x7F01u
 
-/* Resolves `name` (its first `name_len` characters: a host name, an IPv4 or
- * IPv6 literal) to an address with `port`. `family` 0 takes the first
- * address the resolver gives. `addr_len` is the room in `addr` on entry and
- * the address's length on return. */
+/* Resolves `name` (its first `name_len` characters, up to a NUL among them:
+ * a host name, an IPv4 or IPv6 literal) to an address with `port` (0..65535).
+ * `family` 0 takes the first address the resolver gives; AF_INET or AF_INET6
+ * only addresses of that family (any other: socket__s_bad_family).
+ * `addr_len` is the room in `addr` on entry and the address's length on
+ * return (socket__s_addr_too_small when it doesn't fit). A name that can't be
+ * resolved, the empty name included, gives rpc__s_unknown_host. `addr` and
+ * `addr_len` are unchanged on failure. */
 NCS_API void socket__from_name(uint32_t family, const char *name, uint32_t name_len, uint32_t port,
                                socket__addr_t *addr, uint32_t *addr_len, uint32_t *status);
-/* Host name (numeric form) and port of an address. `name_len` is the room
- * in `name` on entry and the length of the text on return. */
+/* Host name (numeric form) and port of an IPv4 or IPv6 address (other
+ * families, or an `addr_len` short of the family's address:
+ * socket__s_bad_family). `name_len` is the room in `name` on entry, the text
+ * with its NUL included, and the length of the text without the NUL on
+ * return (socket__s_name_too_long when it doesn't fit: nothing written).
+ * `name`, `name_len` and `port` are unchanged on failure. */
 NCS_API void socket__to_name(const socket__addr_t *addr, uint32_t addr_len, char *name, uint32_t *name_len,
                              uint32_t *port, uint32_t *status);
 /* Whether this process can use the address family: AF_INET, AF_INET6 and
- * socket__family_inproc. */
+ * socket__family_inproc give 1 and rpc__s_ok; any other 0 and
+ * socket__s_bad_family. */
 NCS_API unsigned char socket__valid_family(uint32_t family, uint32_t *status);
-/* Address of the in-process family. */
+/* Address of the in-process family: the family alone, `addr_len` 2. */
 NCS_API void socket__inproc_addr(socket__addr_t *addr, uint32_t *addr_len);
 
 /* ---- Binding handles --------------------------------------------------- */
@@ -216,9 +227,16 @@ typedef void (*rpc__server_stub_t)(handle_t handle, void *in_pkt, uint32_t in_le
 
 /* Registers an interface's server stubs (indexed by operation number, with
  * ifspec->opcnt entries) and its manager table on this process's server.
- * One registration per interface UUID and version. */
+ * One registration per interface UUID and version: a second gives
+ * rpc__s_already_registered; a null ifspec or server_epv rpc__s_unknown_if.
+ * The tables must stay valid until rpc__unregister and the end of the calls
+ * under way then. `type` is not used: one manager table serves all objects. */
 NCS_API void rpc__register_mgr(const uuid__t *type, const rpc__if_spec_t *ifspec,
                                const rpc__server_stub_t *server_epv, const void *mgr_epv, uint32_t *status);
+/* Takes the registration of the interface's UUID and version away; new
+ * requests get rpc__s_unknown_if at once. Calls that already run go on to
+ * their end on the old registration; the call doesn't wait for them.
+ * rpc__s_not_registered when there is none. */
 NCS_API void rpc__unregister(const rpc__if_spec_t *ifspec, uint32_t *status);
 
 /* ---- Status texts ------------------------------------------------------ */

@@ -18,8 +18,15 @@ struct Handle : rpc__handle_rec {
 };
 constexpr uint32_t kHandleMagic = 0x48414e44;  // "HAND"
 
-// Checks that `handle` is a live handle of this runtime; null otherwise.
+// Checks that `handle` is a live handle of this runtime (one of rpc__bind or
+// rpc__dup_handle, not yet freed); null otherwise. Never reads through a
+// pointer that isn't a live handle.
 Handle *handle_of(handle_t handle);
+
+// rpc__s_ok when `addr` of `addr_len` bytes is an address a handle can hold:
+// AF_INET, AF_INET6 or socket__family_inproc, long enough for its family and
+// no longer than socket__addr_t; else socket__s_bad_family.
+uint32_t check_address(const socket__addr_t *addr, uint32_t addr_len);
 
 // A reply as a carrier hands it back to rpc__sar.
 struct Reply {
@@ -42,6 +49,17 @@ public:
                       uint32_t opnum, void *request_pkt, uint32_t request_len, void *reply_buf,
                       uint32_t reply_buf_size, Reply &reply) = 0;
 };
+
+// Chooses where a reply body of `len` bytes goes, under rpc__sar's contract:
+// reply_buf when RPC_DATA_OFFS + len fit reply_buf_size, else a new packet
+// (raises rpc__s_no_memory). Fills reply.pkt, reply.len and reply.must_free
+// and returns where the body starts.
+void *place_reply(uint32_t len, void *reply_buf, uint32_t reply_buf_size, Reply &reply);
+
+// A setting of the runtime from the environment variable `name`, read at
+// every call: a decimal number from 1 to 4294967295; `dflt` when the variable
+// is unset or holds anything else.
+uint32_t setting(const char *name, uint32_t dflt);
 
 // The carrier for the in-process family, and for IPv4 and IPv6.
 Carrier &inproc_carrier();

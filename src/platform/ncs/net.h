@@ -1,0 +1,41 @@
+// What the TCP client and server share: Asio, and the conversion between
+// the runtime's socket addresses and Asio's endpoints. Private to
+// src/platform/ncs.
+#ifndef NCS_NET_H
+#define NCS_NET_H
+
+#include "ncs/ncs.h"
+
+#include <asio.hpp>
+
+#include <cstring>
+
+namespace ncs::net {
+
+using asio::ip::tcp;
+
+// Socket buffers of both ends: a whole body of the interface in flight.
+constexpr int kSocketBuffer = 1024 * 1024;
+
+// The endpoint of an IPv4 or IPv6 address of a handle (checked when the
+// handle was bound).
+inline tcp::endpoint endpoint_of(const socket__addr_t &addr)
+{
+    tcp::endpoint endpoint;
+    size_t len = addr.sa.sa_family == AF_INET6 ? sizeof(sockaddr_in6) : sizeof(sockaddr_in);
+    std::memcpy(endpoint.data(), &addr, len);
+    endpoint.resize(len);
+    return endpoint;
+}
+
+// The runtime's address of an endpoint; returns its length.
+inline uint32_t address_of(const tcp::endpoint &endpoint, socket__addr_t &addr)
+{
+    std::memset(&addr, 0, sizeof addr);
+    std::memcpy(&addr, endpoint.data(), endpoint.size());
+    return static_cast<uint32_t>(endpoint.size());
+}
+
+}  // namespace ncs::net
+
+#endif

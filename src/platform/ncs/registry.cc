@@ -1,0 +1,172 @@
+// Registrations of interfaces on this process's server, and the dispatch of
+// one request to its server stub.
+//
+// The registry maps (interface UUID, version) to a registration held by a
+// shared pointer. A dispatch takes its own reference before it runs the stub,
+// so an interface unregistered while its calls run is gone for new calls at
+// once, and the calls under way finish on the registration they started with.
+#include "ncs/runtime.h"
+
+#include <array>
+#include <cstring>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <shared_mutex>
+#include <utility>
+#include <vector>
+
+namespace {
+
+struct Registration {
+    rpc__if_spec_t ifspec;
+    std::vector<rpc__server_stub_t> stubs;  // ifspec.opcnt entries
+    const void *mgr_epv;
+};
+
+// An interface as the registry orders it: the UUID's 16 bytes and the version.
+using Key = std::pair<std::array<unsigned char, sizeof(uuid__t)>, uint32_t>;
+static_assert(sizeof(uuid__t) == 16, "a UUID has no padding");
+
+Key key_of(const uuid__t &id, uint32_t vers)
+{
+    Key key{{}, vers};
+    std::memcpy(key.first.data(), &id, sizeof id);
+    return key;
+}
+
+class Registry {
+public:
+    uint32_t add(const rpc__if_spec_t &ifspec, const rpc__server_stub_t *stubs, const void *mgr_epv)
+    {
+        auto registration = std::make_shared<Registration>(
+            Registration{ifspec, std::vector<rpc__server_stub_t>(stubs, stubs + ifspec.opcnt), mgr_epv});
+        std::unique_lock<std::shared_mutex> hold(mutex_);
+        auto [where, added] = entries_.try_emplace(key_of(ifspec.id, ifspec.vers), std::move(registration));
+        return added ? rpc__s_ok : rpc__s_already_registered;
+    }
+
+    uint32_t remove(const rpc__if_spec_t &ifspec)
+    {
+        std::unique_lock<std::shared_mutex> hold(mutex_);
+        return entries_.erase(key_of(ifspec.id, ifspec.vers)) != 0 ? rpc__s_ok : rpc__s_not_registered;
+    }
+
+    std::shared_ptr<const Registration> find(const uuid__t &id, uint32_t vers)
+    {
+        std::shared_lock<std::shared_mutex> hold(mutex_);
+        auto where = entries_.find(key_of(id, vers));
+        return where != entries_.end() ? where->second : nullptr;
+    }
+
+private:
+    std::shared_mutex mutex_;  // guards entries_; never held while a stub runs
+    std::map<Key, std::shared_ptr<const Registration>> entries_;
+};
+
+Registry &registry()
+{
+    // Never destroyed: server threads may dispatch during static destruction.
+    static Registry *instance = new Registry;
+    return *instance;
+}
+
+void set_status(uint32_t *status, uint32_t value)
+{
+    if (status != nullptr)
+        *status = value;
+}
+
+// Gives back a reply packet that a stub took before it raised.
+void drop_reply(const ncs::Dispatched &outcome)
+{
+    if (outcome.must_free)
+        rpc__free_pkt(outcome.reply_pkt);
+}
+
+}  // namespace
+
+namespace ncs {
+
+Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint32_t drep, void *in_pkt,
+                    uint32_t in_len, void *out_pkt, uint32_t out_max)
+{
+    Dispatched outcome;
+    std::shared_ptr<const Registration> registration = registry().find(if_id, if_vers);
+    if (registration == nullptr) {
+        outcome.fault = rpc__s_unknown_if;
+        return outcome;
+    }
+    if (opnum >= registration->stubs.size() || registration->stubs[opnum] == nullptr) {
+        outcome.fault = rpc__s_op_rng_error;
+        return outcome;
+    }
+
+    // The binding the stub sees: the stubs read data_offs, the managers
+    // nothing of it.
+    Handle server_handle{};
+    server_handle.data_offs = RPC_DATA_OFFS;
+    server_handle.magic = kHandleMagic;
+
+    uint32_t call_drep = drep;
+    unsigned char must_free = 0;
+    uint32_t st = rpc__s_ok;
+    EXC1_FRAME frame;
+    uint32_t raised = EXC1_FRAME_SET;
+    try {
+        raised = exc::guard(&frame, __FILE__, __LINE__, [&] {
+            registration->stubs[opnum](&server_handle, in_pkt, in_len, out_pkt, out_max, &call_drep,
+                                       registration->mgr_epv, &outcome.reply_pkt, &outcome.reply_len, &must_free,
+                                       &st);
+        });
+    } catch (...) {
+        raised = rpc__s_fault_unspec;
+    }
+    // The offered buffer is the carrier's: it is never a packet to give back.
+    outcome.must_free = must_free != 0 && outcome.reply_pkt != out_pkt;
+
+    if (raised == EXC1_FRAME_SET && st != rpc__s_ok)
+        raised = st;
+    if (raised == EXC1_FRAME_SET) {
+        // A reply the carrier couldn't send safely is a fault of the stub.
+        if (outcome.reply_pkt == nullptr || outcome.reply_len > RPC_MAX_BODY ||
+            (outcome.reply_pkt == out_pkt && outcome.reply_len > out_max))
+            raised = rpc__s_fault_unspec;
+    }
+    if (raised != EXC1_FRAME_SET) {
+        EXC1_Allow();
+        drop_reply(outcome);
+        outcome = Dispatched{};
+        outcome.fault = raised;
+    }
+    return outcome;
+}
+
+}  // namespace ncs
+
+extern "C" {
+
+void rpc__register_mgr(const uuid__t *, const rpc__if_spec_t *ifspec, const rpc__server_stub_t *server_epv,
+                       const void *mgr_epv, uint32_t *status)
+{
+    if (ifspec == nullptr || server_epv == nullptr) {
+        set_status(status, rpc__s_unknown_if);
+        return;
+    }
+    try {
+        set_status(status, registry().add(*ifspec, server_epv, mgr_epv));
+    } catch (const std::bad_alloc &) {
+        set_status(status, rpc__s_no_memory);
+    }
+}
+
+void rpc__unregister(const rpc__if_spec_t *ifspec, uint32_t *status)
+{
+    if (ifspec == nullptr) {
+        set_status(status, rpc__s_not_registered);
+        return;
+    }
+    set_status(status, registry().remove(*ifspec));
+}
+
+}  // extern "C"

@@ -1,0 +1,336 @@
+// The TCP carrier: one call is one request frame and one answer frame on a
+// connection to the server's address (see frame.h).
+//
+// Connections are pooled per address: a call takes an idle connection to its
+// address, or opens one, and gives it back after a complete exchange. A
+// connection that failed in any way is closed, never pooled.
+//
+// Each connection owns a small io_context; the calling thread runs it for
+// the length of one operation, up to the operation's deadline. A deadline
+// that passes closes the connection, which ends the operation. Nothing of a
+// connection is shared while a call uses it.
+//
+// Repeats: a request whose frame didn't leave in full can't have been run by
+// the server (it runs only complete frames), so a failed write on a pooled
+// connection is repeated once on a new connection, whatever the call. Once
+// the frame has left, the request may have run: only an idempotent call is
+// repeated then, once, and only after a failure of a pooled connection (the
+// server may have closed it as idle). Time-outs are never repeated.
+#include "ncs/frame.h"
+#include "ncs/net.h"
+#include "ncs/runtime.h"
+
+#include <array>
+#include <atomic>
+#include <chrono>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+namespace {
+
+using ncs::net::tcp;
+using Clock = std::chrono::steady_clock;
+
+constexpr uint32_t kDefaultConnectTimeoutMs = 5000;
+constexpr uint32_t kDefaultCallTimeoutMs = 120000;
+// Idle connections kept, over all addresses; the oldest goes first.
+constexpr size_t kMaxIdle = 64;
+
+[[noreturn]] void raise(uint32_t status)
+{
+    EXC1__Raise(EXC1_Thread(), status);
+}
+
+// The communication status of a failed socket operation.
+uint32_t status_of(const asio::error_code &ec)
+{
+    if (ec == asio::error::connection_refused)
+        return rpc__s_connect_refused;
+    if (ec == asio::error::connection_reset || ec == asio::error::broken_pipe ||
+        ec == asio::error::connection_aborted)
+        return rpc__s_connection_reset;
+    if (ec == asio::error::timed_out)
+        return rpc__s_timeout;
+    return rpc__s_comm_failure;
+}
+
+// The pool's name for an address: family, port and IP address (with the
+// scope of an IPv6 one), without the padding of the socket structures.
+std::string pool_key(const socket__addr_t &addr)
+{
+    std::string key;
+    auto add = [&key](const void *p, size_t n) { key.append(static_cast<const char *>(p), n); };
+    add(&addr.sa.sa_family, sizeof addr.sa.sa_family);
+    if (addr.sa.sa_family == AF_INET6) {
+        add(&addr.in6.sin6_port, sizeof addr.in6.sin6_port);
+        add(&addr.in6.sin6_addr, sizeof addr.in6.sin6_addr);
+        add(&addr.in6.sin6_scope_id, sizeof addr.in6.sin6_scope_id);
+    } else {
+        add(&addr.in4.sin_port, sizeof addr.in4.sin_port);
+        add(&addr.in4.sin_addr, sizeof addr.in4.sin_addr);
+    }
+    return key;
+}
+
+class Connection {
+public:
+    explicit Connection(std::string key) : key_(std::move(key)) {}
+    Connection(const Connection &) = delete;
+    Connection &operator=(const Connection &) = delete;
+
+    const std::string &key() const { return key_; }
+
+    asio::error_code connect(const tcp::endpoint &endpoint, Clock::time_point deadline)
+    {
+        asio::error_code ec;
+        socket_.open(endpoint.protocol(), ec);
+        if (ec)
+            return ec;
+        // Before the connect, so the window scale fits the buffer.
+        socket_.set_option(tcp::no_delay(true), ec);
+        socket_.set_option(asio::socket_base::send_buffer_size(ncs::net::kSocketBuffer), ec);
+        socket_.set_option(asio::socket_base::receive_buffer_size(ncs::net::kSocketBuffer), ec);
+        return run(deadline, [&](auto done) { socket_.async_connect(endpoint, done); });
+    }
+
+    // Whether an idle connection is still open at the server's end: the
+    // server has neither closed it nor sent anything unasked.
+    bool alive()
+    {
+        unsigned char byte;
+        asio::error_code ec;
+        socket_.non_blocking(true, ec);
+        if (ec)
+            return false;
+        socket_.receive(asio::buffer(&byte, 1), tcp::socket::message_peek, ec);
+        return ec == asio::error::would_block;
+    }
+
+    asio::error_code write(const std::array<asio::const_buffer, 2> &buffers, Clock::time_point deadline)
+    {
+        return run(deadline, [&](auto done) { asio::async_write(socket_, buffers, done); });
+    }
+
+    asio::error_code read(asio::mutable_buffer buffer, Clock::time_point deadline)
+    {
+        return run(deadline, [&](auto done) { asio::async_read(socket_, buffer, done); });
+    }
+
+private:
+    // Starts one operation and runs it to its end or to the deadline.
+    template <class Start>
+    asio::error_code run(Clock::time_point deadline, Start start)
+    {
+        std::optional<asio::error_code> result;
+        start([&result](const asio::error_code &ec, auto &&...) { result = ec; });
+        io_.restart();
+        io_.run_until(deadline);
+        if (!result) {
+            // Closing cancels the operation; its handler still has to run.
+            asio::error_code ignored;
+            socket_.close(ignored);
+            io_.restart();
+            io_.run();
+            return asio::error::timed_out;
+        }
+        return *result;
+    }
+
+    asio::io_context io_{1};
+    tcp::socket socket_{io_};
+    std::string key_;
+};
+
+// Idle connections, newest last.
+class Pool {
+public:
+    // An idle connection to `key` that is still open, or null.
+    std::unique_ptr<Connection> take(const std::string &key)
+    {
+        for (;;) {
+            std::unique_ptr<Connection> connection;
+            {
+                std::lock_guard<std::mutex> hold(mutex_);
+                for (auto it = idle_.rbegin(); it != idle_.rend(); ++it) {
+                    if ((*it)->key() == key) {
+                        connection = std::move(*it);
+                        idle_.erase(std::next(it).base());
+                        break;
+                    }
+                }
+            }
+            if (connection == nullptr || connection->alive())
+                return connection;
+        }
+    }
+
+    void give(std::unique_ptr<Connection> connection)
+    {
+        std::unique_ptr<Connection> dropped;
+        std::lock_guard<std::mutex> hold(mutex_);
+        idle_.push_back(std::move(connection));
+        if (idle_.size() > kMaxIdle) {
+            dropped = std::move(idle_.front());
+            idle_.pop_front();
+        }
+    }
+
+private:
+    std::mutex mutex_;  // guards idle_; never held during socket operations
+    std::deque<std::unique_ptr<Connection>> idle_;
+};
+
+Pool &pool()
+{
+    // Never destroyed: calls may run on threads that outlive static
+    // destruction.
+    static Pool *instance = new Pool;
+    return *instance;
+}
+
+uint32_t next_call_id()
+{
+    static std::atomic<uint32_t> counter{0};
+    uint32_t id;
+    do
+        id = ++counter;
+    while (id == 0);  // 0 names no call
+    return id;
+}
+
+// How one exchange on one connection ended.
+enum class Ending {
+    kReply,    // a reply, placed in the Reply
+    kFault,    // the server's fault status for this call
+    kNotSent,  // the request frame didn't leave in full
+    kLost,     // the request left; its answer didn't come
+    kBroken,   // a time-out or a malformed answer
+};
+
+struct Exchange {
+    Ending ending;
+    uint32_t status = rpc__s_ok;
+    bool keep = false;  // the connection can serve another call
+};
+
+Exchange exchange(Connection &connection, const std::array<asio::const_buffer, 2> &request, uint32_t call_id,
+                  void *reply_buf, uint32_t reply_buf_size, ncs::Reply &reply)
+{
+    Clock::time_point deadline =
+        Clock::now() + std::chrono::milliseconds(ncs::setting("NCS_CALL_TIMEOUT_MS", kDefaultCallTimeoutMs));
+    asio::error_code ec = connection.write(request, deadline);
+    if (ec)
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kNotSent, status_of(ec)};
+
+    ncs::frame::Bytes bytes;
+    ec = connection.read(asio::buffer(bytes), deadline);
+    if (ec)
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, status_of(ec)};
+    ncs::frame::Header header;
+    if (!ncs::frame::decode(bytes, header) || header.kind == ncs::frame::kRequest)
+        return {Ending::kBroken, rpc__s_protocol_error};
+    bool keep = (header.flags & ncs::frame::kClosing) == 0;
+    if (header.kind == ncs::frame::kFault) {
+        // Call id 0: the server refused the connection before the call.
+        if (header.call_id == 0)
+            return {Ending::kFault, header.fault, false};
+        if (header.call_id != call_id)
+            return {Ending::kBroken, rpc__s_protocol_error};
+        return {Ending::kFault, header.fault, keep};
+    }
+    if (header.call_id != call_id)
+        return {Ending::kBroken, rpc__s_protocol_error};
+    if (header.body_len > RPC_MAX_BODY)
+        return {Ending::kBroken, rpc__s_too_big};
+
+    void *body = ncs::place_reply(header.body_len, reply_buf, reply_buf_size, reply);
+    ec = connection.read(asio::buffer(body, header.body_len), deadline);
+    if (ec) {
+        if (reply.must_free)
+            rpc__free_pkt(reply.pkt);
+        reply = ncs::Reply{};
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, status_of(ec)};
+    }
+    reply.drep = header.drep;
+    return {Ending::kReply, rpc__s_ok, keep};
+}
+
+std::unique_ptr<Connection> open_connection(const std::string &key, const socket__addr_t &addr)
+{
+    auto connection = std::make_unique<Connection>(key);
+    Clock::time_point deadline =
+        Clock::now() + std::chrono::milliseconds(ncs::setting("NCS_CONNECT_TIMEOUT_MS", kDefaultConnectTimeoutMs));
+    asio::error_code ec = connection->connect(ncs::net::endpoint_of(addr), deadline);
+    if (ec)
+        raise(status_of(ec));
+    return connection;
+}
+
+class TcpCarrier final : public ncs::Carrier {
+public:
+    void call(const socket__addr_t &addr, uint32_t, uint32_t options, const rpc__if_spec_t &ifspec,
+              uint32_t opnum, void *request_pkt, uint32_t request_len, void *reply_buf, uint32_t reply_buf_size,
+              ncs::Reply &reply) override
+    {
+        ncs::frame::Header header;
+        header.kind = ncs::frame::kRequest;
+        header.flags = static_cast<uint8_t>(options);  // 0 or RPC_OPT_IDEMPOTENT
+        header.call_id = next_call_id();
+        header.drep = NCS_DREP_LOCAL;
+        header.if_id = ifspec.id;
+        header.if_vers = ifspec.vers;
+        header.opnum = opnum;
+        header.body_len = request_len;
+        ncs::frame::Bytes bytes;
+        ncs::frame::encode(header, bytes);
+        const std::array<asio::const_buffer, 2> request = {
+            asio::buffer(bytes), asio::buffer(static_cast<const unsigned char *>(request_pkt) + RPC_DATA_OFFS,
+                                              request_len)};
+        bool idempotent = (options & RPC_OPT_IDEMPOTENT) != 0;
+        std::string key = pool_key(addr);
+
+        for (bool first = true;; first = false) {
+            // A repeat goes on a new connection: the other idle ones may be
+            // as stale as the one that failed.
+            std::unique_ptr<Connection> connection = first ? pool().take(key) : nullptr;
+            bool pooled = connection != nullptr;
+            if (!pooled)
+                connection = open_connection(key, addr);
+            Exchange result = exchange(*connection, request, header.call_id, reply_buf, reply_buf_size, reply);
+            switch (result.ending) {
+            case Ending::kReply:
+            case Ending::kFault:
+                if (result.keep)
+                    pool().give(std::move(connection));
+                if (result.ending == Ending::kFault)
+                    raise(result.status);
+                return;
+            case Ending::kNotSent:
+                if (pooled && first)
+                    continue;
+                raise(result.status);
+            case Ending::kLost:
+                if (pooled && first && idempotent)
+                    continue;
+                raise(result.status);
+            case Ending::kBroken:
+                raise(result.status);
+            }
+        }
+    }
+};
+
+}  // namespace
+
+namespace ncs {
+
+Carrier &tcp_carrier()
+{
+    static TcpCarrier carrier;
+    return carrier;
+}
+
+}  // namespace ncs
