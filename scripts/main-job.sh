@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
-# The main job: builds everything, then moves a file between two processes on
-# loopback. Starts dpx-agentd (with its own location broker) on a fresh depot
-# in a temporary directory, puts a generated file of 256 MiB with the dpx
-# client, gets it back to another place, compares SHA-256 and prints the rates.
+# The main job: builds the two programs, then moves a file between two
+# processes on loopback. Starts dpx-agentd (with its own location broker) on a
+# fresh depot in a temporary directory, puts a generated file of 256 MiB
+# (DPX_DEMO_MIB) with the dpx client, gets it back to another place, compares
+# SHA-256, prints the rates and stops the daemon.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/deps.sh
@@ -63,8 +64,13 @@ echo "get  $size_mib MiB in ${get_s}s: $(rate "$get_s")"
 echo "sha256 source $src_sum"
 echo "sha256 depot  $depot_sum"
 echo "sha256 copy   $copy_sum"
-if [ "$src_sum" = "$depot_sum" ] && [ "$src_sum" = "$copy_sum" ]; then
+kill -TERM "$daemon"
+daemon_status=0
+wait "$daemon" || daemon_status=$?
+daemon=
+echo "== dpx-agentd stopped with exit status $daemon_status"
+if [ "$src_sum" = "$depot_sum" ] && [ "$src_sum" = "$copy_sum" ] && [ "$daemon_status" = 0 ]; then
   echo "OK: the file made the round trip unchanged"
 else
-  echo "FAILED: the copies differ"; exit 1
+  echo "FAILED: the copies differ or the daemon did not stop cleanly"; cat "$work/daemon.log"; exit 1
 fi

@@ -2,6 +2,8 @@
 // sends queries, lists nodes, and tells what a status means.
 #include "dpx/dpx.h"
 
+#include <cctype>
+#include <cmath>
 #include <cstdint>
 #include <chrono>
 #include <condition_variable>
@@ -10,6 +12,7 @@
 #include <cstring>
 #include <fstream>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <sys/stat.h>
 #include <thread>
@@ -21,18 +24,19 @@ namespace {
 const char kUsage[] =
     "usage: dpx [--quiet] get NODE PATH TARGET\n"
     "       dpx [--quiet] put NODE PATH SOURCE\n"
-    "       dpx query NODE QUERY PATH\n"
+    "       dpx query NODE|- QUERY PATH\n"
     "       dpx list [FILTER]\n"
     "       dpx status CODE\n"
     "\n"
     "  get     fetch PATH of NODE from the depot into the local file TARGET; TARGET is\n"
     "          replaced only when the whole file has arrived\n"
     "  put     append the local file SOURCE to PATH of NODE in the depot\n"
-    "  query   send QUERY with PATH to NODE; prints the answer\n"
+    "  query   send QUERY with PATH to NODE (- for this node); prints the answer\n"
     "  list    print the names of the nodes the hub knows, one a line\n"
     "  status  print the text of a status CODE (hex like 0xF11E0004, or decimal)\n"
     "  --quiet no progress display (shown on a terminal for transfers above 8 MB)\n"
     "  --help  this text\n"
+    "  --      what follows is not an option, even when it starts with -\n"
     "\n"
     "Exit status: 0 on success; 1 on failure, with one line on standard error holding\n"
     "the status in hex and its text; 2 for a usage error.\n"
@@ -56,26 +60,35 @@ int usage_error(const std::string &message)
     return 2;
 }
 
+// "0xF11E0004 cannot read file": a status in hex and its text.
+std::string status_line(dpx_status status)
+{
+    char text[256];
+    error__c_text(status, text, sizeof text);
+    char line[300];
+    std::snprintf(line, sizeof line, "0x%08X %s", status, text[0] != '\0' ? text : "(no text)");
+    return line;
+}
+
 int report(dpx_status status)
 {
     if (status == DPX_OK)
         return 0;
-    char text[256];
-    error__c_text(status, text, sizeof text);
-    std::fprintf(stderr, "dpx: failed: 0x%08X %s\n", status, text[0] != '\0' ? text : "(no text)");
+    std::fprintf(stderr, "%s\n", status_line(status).c_str());
     return 1;
 }
 
-// Bytes this process has moved through read() or write() calls: a download
-// receives the file through its socket reads, an upload sends it through its
-// socket writes.
+// Bytes this process has moved through read() or write() calls, the line
+// "rchar: N" or "wchar: N" of /proc/self/io. The runtime's socket calls don't
+// count there, the file's do: an upload reads the source with read(), a
+// download writes its temporary file with write().
 uint64_t io_counter(const char *field)
 {
     std::ifstream io("/proc/self/io");
     std::string name;
     uint64_t value = 0;
     while (io >> name >> value) {
-        if (name == field)
+        if (name == std::string(field) + ":")
             return value;
     }
     return 0;
@@ -95,7 +108,8 @@ std::string human_bytes(double bytes)
 }
 
 // Shows bytes, rate and (with a known total) time left on standard error while
-// a transfer runs on another thread.
+// a transfer runs on another thread, once more than kProgressThreshold bytes
+// have moved or are to move.
 class Progress {
 public:
     Progress(const char *field, uint64_t total) : field_(field), total_(total), base_(io_counter(field)) {}
@@ -116,7 +130,8 @@ public:
             show(start);
         hold.unlock();
         worker.join();
-        std::fputs("\r\033[K", stderr);
+        if (shown_)
+            std::fputs("\r\033[K", stderr);
         return status;
     }
 
@@ -127,13 +142,16 @@ private:
         uint64_t moved = io_counter(field_) - base_;
         if (total_ > 0 && moved > total_)
             moved = total_;
+        if (total_ <= kProgressThreshold && moved <= kProgressThreshold)
+            return;
+        shown_ = true;
         double rate = seconds > 0 ? moved / seconds : 0;
         std::string line = "\r" + human_bytes(static_cast<double>(moved));
         if (total_ > 0)
             line += " of " + human_bytes(static_cast<double>(total_));
         line += ", " + human_bytes(rate) + "/s";
         if (total_ > 0 && rate > 0)
-            line += ", " + std::to_string(static_cast<long>((total_ - moved) / rate)) + " s left";
+            line += ", " + std::to_string(static_cast<long>(std::ceil((total_ - moved) / rate))) + " s left";
         std::fprintf(stderr, "%s\033[K", line.c_str());
         std::fflush(stderr);
     }
@@ -144,12 +162,22 @@ private:
     std::mutex mutex_;
     std::condition_variable wake_;
     bool done_ = false;
+    bool shown_ = false;
 };
 
-bool show_progress(bool quiet, uint64_t size)
+bool show_progress(bool quiet)
 {
-    return !quiet && isatty(STDERR_FILENO) && size > kProgressThreshold;
+    return !quiet && isatty(STDERR_FILENO);
 }
+
+// The library's start and stop around the commands that reach the hub: the
+// locks, and the retry settings from the environment.
+struct Library {
+    Library() { dpx_agent_init(); }
+    ~Library() { dpx_agent_stop(); }
+    Library(const Library &) = delete;
+    Library &operator=(const Library &) = delete;
+};
 
 }  // namespace
 
@@ -157,29 +185,40 @@ int main(int argc, char **argv)
 {
     std::vector<std::string> args;
     bool quiet = false;
+    bool options_end = false;
     for (int i = 1; i < argc; ++i) {
         std::string arg = argv[i];
-        if (arg == "--help" || arg == "-h") {
+        // "-" names this node; a negative CODE is a number, not an option.
+        bool option = !options_end && arg.size() > 1 && arg[0] == '-' &&
+                      !(args.size() == 1 && args[0] == "status" && std::isdigit(static_cast<unsigned char>(arg[1])));
+        if (!option) {
+            args.push_back(arg);
+        } else if (arg == "--") {
+            options_end = true;
+        } else if (arg == "--help" || arg == "-h") {
             std::fputs(kUsage, stdout);
             return 0;
-        }
-        if (arg == "--quiet" || arg == "-q")
+        } else if (arg == "--quiet" || arg == "-q") {
             quiet = true;
-        else
-            args.push_back(arg);
+        } else {
+            return usage_error("unknown option " + arg);
+        }
     }
     if (args.empty())
         return usage_error("no command");
     const std::string &command = args[0];
     size_t operands = args.size() - 1;
+    std::optional<Library> library;
+    if (command == "get" || command == "put" || command == "query" || command == "list")
+        library.emplace();
 
     if (command == "get") {
         if (operands != 3)
             return usage_error("get wants NODE PATH TARGET");
         auto work = [&] { return GetFile(args[1].c_str(), args[2].c_str(), args[3].c_str()); };
         // The size is only known once the file has arrived: show bytes and rate.
-        if (show_progress(quiet, kProgressThreshold + 1))
-            return report(Progress("rchar", 0).run(work));
+        if (show_progress(quiet))
+            return report(Progress("wchar", 0).run(work));
         return report(work());
     }
     if (command == "put") {
@@ -188,8 +227,8 @@ int main(int argc, char **argv)
         struct stat st;
         uint64_t size = stat(args[3].c_str(), &st) == 0 ? static_cast<uint64_t>(st.st_size) : 0;
         auto work = [&] { return PutFile(args[1].c_str(), args[2].c_str(), args[3].c_str()); };
-        if (show_progress(quiet, size))
-            return report(Progress("wchar", size).run(work));
+        if (show_progress(quiet) && size > kProgressThreshold)
+            return report(Progress("rchar", size).run(work));
         return report(work());
     }
     if (command == "query") {
@@ -225,10 +264,7 @@ int main(int argc, char **argv)
         long long code = std::strtoll(args[1].c_str(), &end, 0);
         if (end == args[1].c_str() || *end != '\0' || code < INT32_MIN || code > static_cast<long long>(UINT32_MAX))
             return usage_error("CODE must be a 32-bit number");
-        auto status = static_cast<uint32_t>(code);
-        char text[256];
-        error__c_text(status, text, sizeof text);
-        std::printf("0x%08X %s\n", status, text[0] != '\0' ? text : "(no text)");
+        std::printf("%s\n", status_line(static_cast<uint32_t>(code)).c_str());
         return 0;
     }
     return usage_error("unknown command " + command);

@@ -29,7 +29,8 @@ template <class Call>
 void call_with_retry(const trc::Scope &scope, const char *failure, dpx_status *status, Call &&call)
 {
     int32_t interval = MIN_DPX_RETRY_INTERVAL;
-    int32_t tries_left = MAX_DPX_RETRY;
+    // Wider than the setting: a setting of INT32_MIN can't wrap when lowered.
+    int64_t tries_left = MAX_DPX_RETRY;
     EXC1_FRAME frame;
     uint32_t outcome;
     try {

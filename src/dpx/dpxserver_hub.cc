@@ -108,9 +108,11 @@ void lookup_handle(handle_t *binding, socket__addr_t *addr, uint32_t addr_len, d
     for (int walked = 0;; ++walked) {
         if (walked == kMaxBrokerEntries) {
             found = 0;
-            break;
+            *status = lb__s_not_registered;
+        } else {
+            lb__lookup_range(&uuid__nil, &uuid__nil, &if_uuid, "", addr, addr_len, &entry, 1, &found, &result,
+                             status);
         }
-        lb__lookup_range(&uuid__nil, &uuid__nil, &if_uuid, "", addr, addr_len, &entry, 1, &found, &result, status);
         if (found < 1) {
             TRC1_ERROR_MSG("no interface found in lb__lookup_range");
             break;

@@ -1,7 +1,13 @@
 // A hub for tests: serves the interface with the library's own managers, but
 // can answer as peers outside this library do: busy a number of times, quiet,
-// with a list of node names, with a damaged checksum. Prints
-// "listening on HOST:PORT", then one line per call: "call OP 0xSTATUS".
+// with a list of node names or a query result, with a damaged checksum, or
+// with a file that grows during a download. Prints "listening on HOST:PORT",
+// then one line per call: "call OP 0xSTATUS" (agent_query first prints
+// "query node=NODE").
+//
+// usage: dpx_test_peer --depot DIR --product NAME [--hub] [--broker]
+//            [--busy K] [--quiet] [--nodes A,B,C] [--query-result N]
+//            [--corrupt-get N] [--grow-after-get N]
 #include "dpx/dpx.h"
 
 #include "afw/afw.h"
@@ -13,6 +19,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
 #include <mutex>
 #include <pthread.h>
 #include <sstream>
@@ -26,7 +33,9 @@ bool g_quiet = false;
 std::vector<std::string> g_nodes;
 bool g_has_nodes = false;
 int g_corrupt_call = 0;          // get_chunks call (1-based) whose checksum is damaged
+int g_grow_call = 0;             // get_chunks call (1-based) after which the file grows
 std::atomic<int> g_get_calls{0};
+bool g_has_query_result = false;
 uint32_t g_query_result = 0;
 std::mutex g_out_mutex;
 
@@ -40,7 +49,10 @@ void report(const char *op, dpx_status status)
 // True when this call is answered by the peer's own rule, with `*status` set.
 bool answered_by_rule(dpx_status *status)
 {
-    if (g_busy_left.fetch_sub(1) > 0) {
+    int busy_left = g_busy_left.load();
+    while (busy_left > 0 && !g_busy_left.compare_exchange_weak(busy_left, busy_left - 1)) {
+    }
+    if (busy_left > 0) {
         *status = DPX_E_BUSY;
         return true;
     }
@@ -51,13 +63,25 @@ bool answered_by_rule(dpx_status *status)
     return false;
 }
 
+// Appends a byte to the depot file of `path`, so that its identity changes.
+void grow(const char *path)
+{
+    char full[DPX_PATH_LEN];
+    if (dpx_get_full_path(path, full, sizeof full) != DPX_OK)
+        return;
+    std::ofstream(full, std::ios::binary | std::ios::app) << '+';
+}
+
 void peer_get_chunks(handle_t h, dpx_file_desc *desc, uint32_t *crc, uint8_t *state, uint32_t *index, int16_t *last,
                      int16_t max, dpx_status *status, dpx_chunk buffer[])
 {
     if (!answered_by_rule(status)) {
         dpx_get_chunks(h, desc, crc, state, index, last, max, status, buffer);
-        if (++g_get_calls == g_corrupt_call)
+        int call = ++g_get_calls;
+        if (call == g_corrupt_call)
             *crc ^= 0x5A5A5A5A;
+        if (call == g_grow_call && *status == DPX_OK)
+            grow(desc->path);
     }
     report("get_chunks", *status);
 }
@@ -79,7 +103,7 @@ void peer_agent_query(handle_t h, dpx_query_text query, dpx_file_desc desc, uint
             std::lock_guard<std::mutex> hold(g_out_mutex);
             std::printf("query node=%s\n", node);
         }
-        if (g_has_nodes) {
+        if (g_has_query_result) {
             *result = g_query_result;
             *status = DPX_OK;
         } else {
@@ -135,8 +159,12 @@ int main(int argc, char **argv)
             g_quiet = true;
         else if (arg == "--corrupt-get")
             g_corrupt_call = std::atoi(next().c_str());
-        else if (arg == "--query-result")
+        else if (arg == "--grow-after-get")
+            g_grow_call = std::atoi(next().c_str());
+        else if (arg == "--query-result") {
+            g_has_query_result = true;
             g_query_result = static_cast<uint32_t>(std::strtoul(next().c_str(), nullptr, 0));
+        }
         else if (arg == "--nodes") {
             g_has_nodes = true;
             std::stringstream list(next());

@@ -187,6 +187,8 @@ int Process::wait(std::chrono::milliseconds timeout)
         }
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
+    std::unique_lock<std::mutex> hold(mutex_);
+    changed_.wait_until(hold, deadline, [&] { return eof_; });
     return wstatus_;
 }
 
@@ -208,14 +210,15 @@ uint16_t free_port()
 }
 
 Daemon::Daemon(const std::string &depot, const std::string &product, std::vector<std::string> extra,
-               const std::string &program)
+               const std::string &program, uint16_t broker_port)
 {
-    // The broker port may have been taken between free_port and the start:
-    // try a few.
+    // A broker port of its own may have been taken between free_port and the
+    // start: try a few.
     for (int attempt = 0; attempt < 5 && port == 0; ++attempt) {
-        lb_port = free_port();
-        std::vector<std::string> argv = {bin_dir() + "/" + program, "--depot", depot, "--product", product,
-                                         "--broker", "--hub"};
+        lb_port = broker_port != 0 ? broker_port : free_port();
+        std::vector<std::string> argv = {bin_dir() + "/" + program, "--depot", depot, "--product", product, "--hub"};
+        if (broker_port == 0)
+            argv.push_back("--broker");
         argv.insert(argv.end(), extra.begin(), extra.end());
         process = std::make_unique<Process>(argv,
                                             std::map<std::string, std::optional<std::string>>{
@@ -227,6 +230,12 @@ Daemon::Daemon(const std::string &depot, const std::string &product, std::vector
         port = static_cast<uint16_t>(std::stoi(line->substr(colon + 1)));
     }
     EXPECT_NE(port, 0) << program << " did not start";
+}
+
+int Daemon::stop()
+{
+    process->signal(SIGTERM);
+    return process->wait();
 }
 
 }  // namespace dpxtest

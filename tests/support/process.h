@@ -19,9 +19,9 @@ namespace dpxtest {
 
 class Process {
 public:
-    // Starts `argv[0]` (a path) with the arguments; `env` is added to (or, with
-    // an empty value and `unset` true, removed from) the test's environment.
-    // Standard error goes to `stderr_file` when given, else is inherited.
+    // Starts `argv[0]` (a path) with the arguments; `env` is added to the
+    // test's environment (a nullopt value removes the variable). Standard error
+    // goes to `stderr_file` when given, else is inherited.
     Process(std::vector<std::string> argv, std::map<std::string, std::optional<std::string>> env = {},
             std::string stderr_file = "");
     ~Process();  // SIGKILL if still running, then reap
@@ -38,8 +38,9 @@ public:
     // Number of lines so far that start with `prefix`.
     size_t count_lines(const std::string &prefix);
     void signal(int signo);
-    // Waits for the end; returns the exit status as waitpid gives it, or -1
-    // on a time-out (the process is then killed).
+    // Waits for the end and for the last line of its output; returns the exit
+    // status as waitpid gives it, or -1 on a time-out (the process is then
+    // killed).
     int wait(std::chrono::milliseconds timeout = std::chrono::seconds(30));
     bool running();
 
@@ -57,11 +58,14 @@ private:
     bool eof_ = false;
 };
 
-// A dpx-agentd (or the test peer, with `program`) on 127.0.0.1 with its own
-// broker at a free port: `port` is where it listens, `lb_port` the broker.
+// A dpx-agentd (or the test peer, with `program`) on 127.0.0.1, registered as
+// the hub: with its own broker at a free port, or, given `broker_port`, in the
+// broker that runs there. `port` is where it listens, `lb_port` the broker.
 struct Daemon {
     Daemon(const std::string &depot, const std::string &product, std::vector<std::string> extra = {},
-           const std::string &program = "dpx-agentd");
+           const std::string &program = "dpx-agentd", uint16_t broker_port = 0);
+    // Stops it with SIGTERM; its exit status as waitpid gives it.
+    int stop();
     std::unique_ptr<Process> process;
     uint16_t port = 0;
     uint16_t lb_port = 0;
