@@ -1,5 +1,5 @@
 #!/usr/bin/env bash
-# The main job: builds the two programs, then moves a file between two
+# The main job: builds everything, then moves a file between two
 # processes on loopback. Starts dpx-agentd (with its own location broker) on a
 # fresh depot in a temporary directory, puts a generated file of 256 MiB
 # (DPX_DEMO_MIB) with the dpx client, gets it back to another place, compares
