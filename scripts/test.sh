@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Builds everything and runs the whole suite twice: a normal build, then one
-# with AddressSanitizer and UndefinedBehaviorSanitizer.
+# with AddressSanitizer and UndefinedBehaviorSanitizer; then, where clang is
+# installed, runs each fuzz target for a few seconds under libFuzzer.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/deps.sh
@@ -20,3 +21,8 @@ cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DDPX_SANITIZE=ON -DDPX_BUILD_
 cmake --build build-asan -j"$jobs"
 ASAN_OPTIONS=detect_leaks=1:abort_on_error=0 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
   DPX_SKIP_SLOW=1 ctest --test-dir build-asan --output-on-failure -j"$jobs" --timeout 900
+
+if command -v clang++ >/dev/null; then
+  echo "== fuzz targets (clang, libFuzzer, a few seconds each)"
+  DPX_FUZZ_SECONDS=10 bash tests/fuzz/run-long.sh build-fuzz
+fi

@@ -17,20 +17,25 @@ namespace {
 
 const char kUsage[] =
     "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub] [--broker]\n"
+    "                  [--confine]\n"
     "\n"
     "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
     "\n"
     "  --depot DIR         depot root (sets DPX_DEPOTROOT for the library)\n"
     "  --product NAME      product name; files are served below DIR/NAME\n"
     "  --listen HOST:PORT  address to listen on (default 127.0.0.1 and a free port)\n"
-    "  --threads N         threads that run calls (default 8)\n"
+    "  --threads N         threads that run calls, 1 to 64 (default 8)\n"
     "  --hub               register this server in the host's location broker as the hub,\n"
     "                      so that clients whose hub is this host find it\n"
     "  --broker            run the location broker inside this process, on the broker port\n"
+    "  --confine           refuse (0xF11E0001) a path whose real location, symbolic links\n"
+    "                      resolved, leaves DIR/NAME; off by default, when links in the\n"
+    "                      depot are followed wherever they point (sets DPX_CONFINE=1)\n"
     "  --help              this text\n"
     "\n"
     "When ready it prints one line \"listening on HOST:PORT\" on standard output.\n"
-    "It logs to standard error. SIGTERM or SIGINT stop it: calls under way finish.\n"
+    "It logs to standard error. SIGTERM or SIGINT stop it: calls under way finish,\n"
+    "and it exits 0. It exits 1 when it can't listen, 2 on a usage error.\n"
     "\n"
     "Environment:\n"
     "  NCS_LB_PORT             port of the location broker (default 135)\n"
@@ -50,6 +55,7 @@ struct Options {
     uint32_t threads = 8;
     bool hub = false;
     bool broker = false;
+    bool confine = false;
 };
 
 int usage_error(const char *message)
@@ -117,13 +123,15 @@ int main(int argc, char **argv)
             const char *v = value("--threads");
             char *end = nullptr;
             unsigned long n = v != nullptr ? std::strtoul(v, &end, 10) : 0;
-            if (v == nullptr || *end != '\0' || n == 0 || n > 1024)
-                return usage_error("--threads wants a number from 1 to 1024");
+            if (v == nullptr || *end != '\0' || n == 0 || n > 64)
+                return usage_error("--threads wants a number from 1 to 64");
             options.threads = static_cast<uint32_t>(n);
         } else if (arg == "--hub") {
             options.hub = true;
         } else if (arg == "--broker") {
             options.broker = true;
+        } else if (arg == "--confine") {
+            options.confine = true;
         } else {
             return usage_error(("unknown argument " + arg).c_str());
         }
@@ -140,6 +148,8 @@ int main(int argc, char **argv)
     std::signal(SIGPIPE, SIG_IGN);
 
     setenv("DPX_DEPOTROOT", options.depot.c_str(), 1);
+    if (options.confine)
+        setenv("DPX_CONFINE", "1", 1);
     AFW_SetProductName(options.product.c_str());
 
     uint32_t status = rpc__s_ok;
@@ -188,10 +198,12 @@ int main(int argc, char **argv)
     sigwait(&stop_signals, &signal_number);
     std::fprintf(stderr, "dpx-agentd: signal %d, stopping\n", signal_number);
 
+    // Out of the broker first, so that no client finds this server any more;
+    // then the calls under way run to their end before the library stops.
     if (options.hub)
         lb__unregister(&entry, &status);
-    dpx_agent_stop();
     rpc__stop_listening();
+    dpx_agent_stop();
     if (options.broker)
         lb__stop_broker();
     std::fprintf(stderr, "dpx-agentd: stopped\n");

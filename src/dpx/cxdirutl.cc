@@ -3,6 +3,8 @@
 #include "cxfile.h"
 
 #include <cerrno>
+#include <climits>
+#include <cstdlib>
 #include <cstring>
 #include <sys/stat.h>
 
@@ -149,6 +151,36 @@ cx_status cx_file_info_last_mod(const cx_file_info_t *info, int32_t *time)
     // them.
     *time = static_cast<int32_t>(info->st_mtime);
     return status;
+}
+
+cx_status cx_real_path(const char *path, char *real, size_t real_size)
+{
+    if (path == nullptr || real == nullptr)
+        return cx_posix_failure(EINVAL);
+    char head[PATH_MAX];
+    size_t head_length = std::strlen(path);
+    if (head_length >= sizeof head)
+        return cx_posix_failure(ENAMETOOLONG);
+    std::memcpy(head, path, head_length + 1);
+    // Level by level from the end, until a leading part resolves; what was
+    // cut off is missing and is appended as given.
+    char resolved[PATH_MAX];
+    while (realpath(head, resolved) == nullptr) {
+        struct stat info;
+        if ((errno != ENOENT && errno != ENOTDIR) || lstat(head, &info) == 0)
+            return cx_posix_failure(errno == ENOENT || errno == ENOTDIR ? ELOOP : errno);
+        char *cut = std::strrchr(head, '/');
+        if (cut == nullptr || cut == head)
+            return cx_posix_failure(ENOENT);
+        *cut = '\0';
+    }
+    const char *rest = path + std::strlen(head);
+    size_t length = std::strlen(resolved);
+    if (length + std::strlen(rest) >= real_size)
+        return cx_posix_failure(ENAMETOOLONG);
+    std::memcpy(real, resolved, length);
+    std::strcpy(real + length, rest);
+    return CX_STATUS_SUCCESS;
 }
 
 }  // extern "C"

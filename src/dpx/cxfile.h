@@ -32,6 +32,13 @@ bool cx_succeeded(cx_status status);
  * make and fails with ENOENT. */
 cx_status cx_mkdirs_for_file(const char *path);
 
+/* The real location of `path` into `real` of `real_size` bytes: its longest
+ * leading part that exists, with every symbolic link, "." and ".." resolved,
+ * then the missing levels as `path` gives them. Fails with ELOOP when a
+ * level exists but can't be resolved (a link to nothing, a loop of links),
+ * ENAMETOOLONG when the result doesn't fit, else with the platform's errno. */
+cx_status cx_real_path(const char *path, char *real, size_t real_size);
+
 /* The bodies of the exported operations of the same name without "posix":
  * they call the platform and make no directories. */
 cx_status cx_open_posix_file(const char *path, cx_os_file_t *file, int32_t mode);

@@ -51,7 +51,8 @@ dpx_status dpx_get_full_path_of_field(const char *field, size_t field_size, char
         return DPX_E_NO_DEPOT;
     if (field == nullptr || std::memchr(field, '\0', field_size) == nullptr)
         return DPX_E_INVALID_PARAM;
-    return dpx_get_full_path(field, full, full_size);
+    dpx_status status = dpx_get_full_path(field, full, full_size);
+    return status == DPX_OK ? dpx_confine_full_path(full) : status;
 }
 
 }  // extern "C"
@@ -62,7 +63,11 @@ void dpx_get_chunks(handle_t, dpx_file_desc *desc, uint32_t *crc, uint8_t *state
                     int16_t max, dpx_status *status, dpx_chunk buffer[])
 {
     TRC1_FUNCTION();
-    if (desc == nullptr || state == nullptr || index == nullptr || last == nullptr || buffer == nullptr) {
+    // Without `status` there is no way to answer: nothing is touched.
+    if (status == nullptr)
+        return;
+    if (desc == nullptr || crc == nullptr || state == nullptr || index == nullptr || last == nullptr ||
+        buffer == nullptr) {
         *status = DPX_E_INVALID_PARAM;
         return;
     }
@@ -118,6 +123,8 @@ void dpx_put_chunks(handle_t, dpx_file_desc desc, uint32_t crc, uint8_t, int16_t
                     dpx_chunk buffer[])
 {
     TRC1_FUNCTION();
+    if (status == nullptr)
+        return;
     if (last == nullptr || buffer == nullptr) {
         *status = DPX_E_INVALID_PARAM;
         return;
@@ -151,13 +158,15 @@ void dpx_put_chunks(handle_t, dpx_file_desc desc, uint32_t crc, uint8_t, int16_t
 void dpx_agent_query(handle_t, dpx_query_text, dpx_file_desc, uint32_t *, dpx_status *status)
 {
     TRC1_FUNCTION();
-    *status = DPX_E_INVALID_PARAM;
+    if (status != nullptr)
+        *status = DPX_E_INVALID_PARAM;
 }
 
 void dpx_list_nodes(handle_t, dpx_node_filter, int16_t *, int16_t, dpx_status *status, dpx_node_name[])
 {
     TRC1_FUNCTION();
-    *status = DPX_E_INVALID_PARAM;
+    if (status != nullptr)
+        *status = DPX_E_INVALID_PARAM;
 }
 
 const dpx_transfer_v1_epv_t dpx_transfer_v1_manager_epv = {dpx_get_chunks, dpx_put_chunks, dpx_agent_query,
