@@ -1,11 +1,24 @@
 // The RPC server: an acceptor and one session per connection on an
 // io_context that the server's threads run.
 //
-// A session reads one request frame at a time, dispatches it on the thread
-// that completed the read and writes the answer before it reads the next
-// frame, so a session has one operation outstanding at a time, plus its
-// timer; both run on the session's strand. A call thus holds a thread of the
-// pool for its dispatch: calls at once are bounded by the threads.
+// Each thread of the server runs an io_context of its own, and an accepted
+// connection belongs to one of them, chosen in turn: no handler ever hands
+// work to another thread, so the threads never wake or wait for each other.
+// Calls of connections of one thread take turns; calls at once are bounded
+// by the threads. The acceptor has a thread of its own, so connections are
+// taken while every call thread is busy.
+//
+// A session reads one request frame at a time, dispatches it on its thread
+// and writes the answer before it reads the next frame, so a session has one
+// operation outstanding at a time, plus its timer; both run on the session's
+// strand.
+//
+// Every completion that goes through the io_context costs a trip through its
+// queue and its epoll. So a session's socket is non-blocking, and a
+// body that is already there, or a reply that the socket buffer takes whole,
+// moves on the spot; only the rest waits for an asynchronous operation. The
+// idle timer isn't re-armed per call either: it fires once per idle period
+// and looks at when the session began its present wait for the peer.
 //
 // Lock order: Server::mutex_ guards the session table and the stop flag and
 // is never held while a handler runs or a socket is touched.
@@ -66,7 +79,14 @@ public:
     }
     ~Session();
 
-    void start() { read_header(); }
+    void start()
+    {
+        asio::error_code ignored;
+        socket_.non_blocking(true, ignored);
+        touch();
+        arm_timer();
+        read_header();
+    }
     // Runs on the strand: closes the connection unless a call is under way.
     void stop()
     {
@@ -83,6 +103,8 @@ private:
     void on_body(const asio::error_code &ec);
     void send_fault(uint32_t call_id, uint32_t status, bool closing);
     void send(std::array<asio::const_buffer, 2> buffers, bool closing);
+    void on_sent(const asio::error_code &ec, bool closing);
+    void touch() { waiting_since_ = asio::steady_timer::clock_type::now(); }
     void arm_timer();
     void close()
     {
@@ -94,6 +116,7 @@ private:
     Server &server_;
     tcp::socket socket_;
     asio::steady_timer timer_;
+    asio::steady_timer::time_point waiting_since_;  // start of the present wait for the peer
     ncs::frame::Bytes in_header_;
     ncs::frame::Bytes out_header_;
     ncs::frame::Header request_;
@@ -106,7 +129,8 @@ private:
 class Server {
 public:
     Server(uint32_t threads, uint32_t max_connections, std::chrono::seconds idle_timeout)
-        : thread_count_(threads), max_connections_(max_connections), idle_timeout_(idle_timeout)
+        : thread_count_(threads), max_connections_(max_connections), idle_timeout_(idle_timeout),
+          contexts_(make_contexts(threads))
     {
     }
     Server(const Server &) = delete;
@@ -138,8 +162,11 @@ public:
     void start()
     {
         accept();
-        for (uint32_t i = 0; i < thread_count_; ++i)
-            threads_.emplace_back([this] { run(); });
+        for (auto &context : contexts_)
+            busy_.emplace_back(context->get_executor());
+        for (auto &context : contexts_)
+            threads_.emplace_back([io = context.get()] { run(*io); });
+        threads_.emplace_back([this] { run(accept_io_); });
     }
 
     void stop()
@@ -161,6 +188,8 @@ public:
         for (auto &session : sessions)
             asio::post(session->executor(), [session] { session->stop(); });
         sessions.clear();
+        // Each thread ends once its connections are closed.
+        busy_.clear();
         for (auto &thread : threads_)
             thread.join();
         threads_.clear();
@@ -192,7 +221,8 @@ public:
 private:
     void accept()
     {
-        acceptor_.async_accept(asio::make_strand(io_),
+        asio::io_context &io = *contexts_[next_context_++ % contexts_.size()];
+        acceptor_.async_accept(asio::make_strand(io),
                                asio::bind_executor(acceptor_strand_, [this](const asio::error_code &ec,
                                                                             tcp::socket socket) {
                                    if (ec == asio::error::operation_aborted || !acceptor_.is_open())
@@ -226,12 +256,20 @@ private:
         });
     }
 
-    void run()
+    static std::vector<std::unique_ptr<asio::io_context>> make_contexts(uint32_t count)
+    {
+        std::vector<std::unique_ptr<asio::io_context>> contexts;
+        for (uint32_t i = 0; i < count; ++i)
+            contexts.push_back(std::make_unique<asio::io_context>(1));
+        return contexts;
+    }
+
+    static void run(asio::io_context &io)
     {
         // A handler that throws ends only its own session's work.
         for (;;) {
             try {
-                io_.run();
+                io.run();
                 return;
             } catch (...) {
             }
@@ -242,16 +280,20 @@ private:
     const uint32_t max_connections_;
     const std::chrono::seconds idle_timeout_;
 
-    // Declared before io_: sessions that io_ still holds when it goes
-    // unregister themselves here.
+    // Declared before contexts_: sessions that a context still holds when it
+    // goes unregister themselves here.
     std::mutex mutex_;  // guards the three members below
     bool stopping_ = false;
     uint64_t accepted_ = 0;
     std::map<Session *, std::weak_ptr<Session>> sessions_;
     std::atomic<uint32_t> calls_{0};
 
-    asio::io_context io_;
-    asio::strand<asio::io_context::executor_type> acceptor_strand_{asio::make_strand(io_)};
+    // One per call thread.
+    std::vector<std::unique_ptr<asio::io_context>> contexts_;
+    std::vector<asio::executor_work_guard<asio::io_context::executor_type>> busy_;  // till stop
+    size_t next_context_ = 0;  // on the acceptor's strand only
+    asio::io_context accept_io_{1};
+    asio::strand<asio::io_context::executor_type> acceptor_strand_{asio::make_strand(accept_io_)};
     tcp::acceptor acceptor_{acceptor_strand_};
     tcp::endpoint local_;
     std::vector<std::thread> threads_;
@@ -262,13 +304,21 @@ Session::~Session()
     server_.forget(this);
 }
 
+// Fires one idle period after the session began to wait for its peer: for
+// a request frame since the last reply went out, or for the peer to read a
+// reply since it began to go out. A manager's run never counts, since the
+// timer's handler can't run on the strand meanwhile. A session that has
+// moved on since waits for the rest of its period.
 void Session::arm_timer()
 {
-    timer_.expires_after(server_.idle_timeout());
+    timer_.expires_at(waiting_since_ + server_.idle_timeout());
     timer_.async_wait([self = shared_from_this()](const asio::error_code &ec) {
-        // A wait that ended on time, not one that was re-armed meanwhile.
-        if (!ec && self->timer_.expiry() <= asio::steady_timer::clock_type::now())
+        if (ec || !self->socket_.is_open())
+            return;
+        if (self->waiting_since_ + self->server_.idle_timeout() <= asio::steady_timer::clock_type::now())
             self->close();
+        else
+            self->arm_timer();
     });
 }
 
@@ -278,7 +328,6 @@ void Session::read_header()
         close();
         return;
     }
-    arm_timer();
     asio::async_read(socket_, asio::buffer(in_header_),
                      [self = shared_from_this()](const asio::error_code &ec, size_t) { self->on_header(ec); });
 }
@@ -299,7 +348,14 @@ void Session::on_header(const asio::error_code &ec)
         return;
     }
     auto *body = static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS;
-    asio::async_read(socket_, asio::buffer(body, request_.body_len),
+    // What has arrived is taken now; the rest is waited for.
+    asio::error_code now;
+    const size_t got = asio::read(socket_, asio::buffer(body, request_.body_len), now);
+    if (now != asio::error::would_block) {
+        on_body(now);
+        return;
+    }
+    asio::async_read(socket_, asio::buffer(body + got, request_.body_len - got),
                      [self = shared_from_this()](const asio::error_code &ec, size_t) { self->on_body(ec); });
 }
 
@@ -309,7 +365,6 @@ void Session::on_body(const asio::error_code &ec)
         close();
         return;
     }
-    timer_.cancel();
     if (offered_pkt_ == nullptr)
         offered_pkt_ = allocate_packet(kOfferedReply);
     void *offered = offered_pkt_.get();
@@ -355,15 +410,31 @@ void Session::send_fault(uint32_t call_id, uint32_t status, bool closing)
 void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
 {
     in_call_ = !closing;
-    arm_timer();
-    asio::async_write(socket_, buffers, [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
-        self->in_call_ = false;
-        self->reply_pkt_.reset();
-        if (ec || closing)
-            self->close();
-        else
-            self->read_header();
+    touch();
+    // What the socket buffer takes goes now; the rest is waited for.
+    asio::error_code now;
+    const size_t sent = asio::write(socket_, buffers, now);
+    if (now != asio::error::would_block) {
+        on_sent(now, closing);
+        return;
+    }
+    const size_t header_sent = std::min(sent, buffers[0].size());
+    const std::array<asio::const_buffer, 2> rest = {buffers[0] + header_sent, buffers[1] + (sent - header_sent)};
+    asio::async_write(socket_, rest, [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
+        self->on_sent(ec, closing);
     });
+}
+
+void Session::on_sent(const asio::error_code &ec, bool closing)
+{
+    in_call_ = false;
+    reply_pkt_.reset();
+    if (ec || closing) {
+        close();
+        return;
+    }
+    touch();
+    read_header();
 }
 
 std::mutex g_server_mutex;  // guards g_server

@@ -6,8 +6,10 @@
  * rpc__listen: "NCS_MAX_CONNECTIONS" connections at once (default 256; a
  * connection beyond is answered rpc__s_server_busy and closed), and
  * "NCS_IDLE_TIMEOUT_S" seconds (default 300) that a connection may stay
- * without a complete frame or a read reply before it is closed. Calls at once
- * are bounded by the number of threads; a call beyond waits for a thread. A
+ * without a complete frame or a read reply before it is closed. Each
+ * connection is served by one of the threads, given in turn as connections
+ * are accepted: calls at once are bounded by the number of threads, and a
+ * call waits while another call of its thread runs. A
  * request above RPC_MAX_BODY is answered rpc__s_too_big before anything is
  * allocated for it; a malformed frame closes its connection only.
  *
