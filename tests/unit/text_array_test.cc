@@ -6,18 +6,14 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
-using DPX::IndexOutOfBoundsException;
-using DPX::UChar;
-using DPX::UCharArray;
+using namespace DPX;
 
-namespace {
-
-UCharArray array_of(std::u16string_view text)
+static UCharArray array_of(std::u16string_view text)
 {
     UCharArray array;
     for (char16_t c : text)
@@ -25,43 +21,16 @@ UCharArray array_of(std::u16string_view text)
     return array;
 }
 
-std::u16string content(const UCharArray &array)
+static std::u16string content(const UCharArray &array)
 {
     return std::u16string(array.getData(), array.getData() + array.getSize());
 }
 
-// The line of a throw site, read from the exception's text.
-int thrown_line(const std::function<void()> &operation)
+TEST(UCharArray, GrowsExactlyToEachRequestAndNeverShrinksOrMovesWithoutNeed)
 {
-    try {
-        operation();
-    } catch (const IndexOutOfBoundsException &e) {
-        int line = 0;
-        EXPECT_EQ(std::sscanf(e.message, "line: %d, file: ", &line), 1) << e.message;
-        EXPECT_NE(std::string(e.message).find("dpxarray.cc"), std::string::npos) << e.message;
-        return line;
-    }
-    ADD_FAILURE() << "no IndexOutOfBoundsException";
-    return 0;
-}
-
-}  // namespace
-
-TEST(UCharArrayGrowth, NewAndSizedArraysHaveTheirFixedCapacities)
-{
-    UCharArray empty;
-    EXPECT_EQ(empty.getSize(), 0u);
-    EXPECT_EQ(empty.getCapacity(), 8u);
-    UCharArray five(5);
-    EXPECT_EQ(five.getSize(), 5u);
-    EXPECT_EQ(five.getCapacity(), 15u);
-    UCharArray zero(0);
-    EXPECT_EQ(zero.getSize(), 0u);
-    EXPECT_EQ(zero.getCapacity(), 10u);
-}
-
-TEST(UCharArrayGrowth, AppendingPastTheCapacityGrowsByExactlyOneUnit)
-{
+    EXPECT_EQ(UCharArray().getCapacity(), 8u);
+    EXPECT_EQ(UCharArray(5).getCapacity(), 15u);
+    EXPECT_EQ(UCharArray(0).getCapacity(), 10u);
     UCharArray array;
     std::vector<uint32_t> capacities;
     for (UChar c = 1; c <= 10; ++c) {
@@ -69,113 +38,63 @@ TEST(UCharArrayGrowth, AppendingPastTheCapacityGrowsByExactlyOneUnit)
         capacities.push_back(array.getCapacity());
     }
     EXPECT_EQ(capacities, (std::vector<uint32_t>{8, 8, 8, 8, 8, 8, 8, 8, 9, 10}));
-    EXPECT_EQ(content(array), u"\x01\x02\x03\x04\x05\x06\x07\x08\x09\x0A");
-}
-
-TEST(UCharArrayGrowth, ReserveNeverShrinksAndGrowStaysInPlaceWhileItFits)
-{
-    UCharArray array = array_of(u"abcdefg");
-    array.reserveCapacity(8);
-    array.reserveCapacity(3);  // below the size
-    EXPECT_EQ(array.getCapacity(), 8u);
-    const UChar *block = array.getData();
-    array.grow(1);
-    EXPECT_EQ(array.getSize(), 8u);
-    EXPECT_EQ(array.getData(), block);
-    array.reserveCapacity(1000);
-    EXPECT_EQ(array.getCapacity(), 1000u);
-    EXPECT_EQ(content(array).substr(0, 7), u"abcdefg");
     array.clear();
-    EXPECT_EQ(array.getSize(), 0u);
     EXPECT_EQ(array.getCapacity(), 8u);
-}
 
-TEST(UCharArrayGrowth, ACopyTakesTheCapacityOfItsSource)
-{
-    UCharArray source = array_of(u"abc");
+    UCharArray seven = array_of(u"abcdefg");
+    seven.reserveCapacity(3);  // below the size
+    const UChar *block = seven.getData();
+    seven.grow(1);
+    seven.remove(0, 2);
+    EXPECT_EQ(seven.getCapacity(), 8u);
+    EXPECT_EQ(seven.getData(), block);
+
+    UCharArray source = array_of(u"abc"), assigned = array_of(u"x");
     source.reserveCapacity(40);
-    UCharArray copy(source);
+    source = static_cast<const UCharArray &>(source);
+    assigned = source;
+    UCharArray copy(assigned);
     EXPECT_EQ(copy.getCapacity(), 40u);
     EXPECT_EQ(content(copy), u"abc");
-    UCharArray assigned;
-    assigned = source;
-    EXPECT_EQ(assigned.getCapacity(), 40u);
-    EXPECT_NE(assigned.getData(), source.getData());
-
-    const UChar *block = source.getData();
-    UCharArray &self = source;
-    source = self;
-    EXPECT_EQ(source.getData(), block);
-    EXPECT_EQ(content(source), u"abc");
 }
 
-TEST(UCharArrayBounds, IndexingIsCheckedAgainstTheSize)
+TEST(UCharArray, EditsMoveTheTailAndABoundFailureThrowsTracedAndLeavesTheArray)
 {
-    UCharArray array = array_of(u"xyz");
-    const UCharArray &read_only = array;
-    EXPECT_EQ(read_only[2], u'z');
-    array[2] = u'w';
-    EXPECT_EQ(read_only[2], u'w');
-    EXPECT_THROW(array[3], IndexOutOfBoundsException);
-    EXPECT_THROW(read_only[3], IndexOutOfBoundsException);
-    UCharArray empty;
-    for (uint32_t i : {0u, 1u, 7u, UINT32_MAX})
-        EXPECT_THROW(empty[i], IndexOutOfBoundsException) << i;
-}
-
-TEST(UCharArrayBounds, InsertAndRemoveMoveTheTailAndRejectPositionsBeyondIt)
-{
-    UCharArray array = array_of(u"ad");
+    using Op = std::function<void(UCharArray &)>;
     const UChar bc[] = {u'b', u'c'};
-    array.insert(1, bc, 2);
-    array.insert(4, UChar{u'e'});  // at the size: as append
-    array.prepend(UChar{u'_'});
-    EXPECT_EQ(content(array), u"_abcde");
-    EXPECT_THROW(array.insert(7, bc, 2), IndexOutOfBoundsException);
-    EXPECT_EQ(content(array), u"_abcde");
-
-    uint32_t capacity = array.getCapacity();
-    const UChar *block = array.getData();
-    array.remove(0);
-    array.remove(1, 2);
-    EXPECT_EQ(content(array), u"ade");
-    EXPECT_EQ(array.getCapacity(), capacity);
-    EXPECT_EQ(array.getData(), block);
-
-    array.remove(3, 0);  // nothing, at the size
-    EXPECT_THROW(array.remove(3), IndexOutOfBoundsException);
-    EXPECT_THROW(array.remove(1, UINT32_MAX), IndexOutOfBoundsException);  // pos + n wraps
-    EXPECT_EQ(content(array), u"ade");
+    // What, start, edit, the content after it, and the function that throws (or null).
+    const std::tuple<const char *, std::u16string_view, Op, std::u16string_view, const char *> rows[] = {
+        {"write at size - 1", u"xyz", [](UCharArray &a) { a[2] = u'w'; }, u"xyw", nullptr},
+        {"[size]", u"xyz", [](UCharArray &a) { a[3]; }, u"xyz", "operator[]"},
+        {"const [size]", u"xyz", [](UCharArray &a) { static_cast<const UCharArray &>(a)[3]; }, u"xyz", "operator[]"},
+        {"[0] of empty", u"", [](UCharArray &a) { a[0]; }, u"", "operator[]"},
+        {"insert inside", u"ad", [&](UCharArray &a) { a.insert(1, bc, 2); }, u"abcd", nullptr},
+        {"insert at size", u"ad", [](UCharArray &a) { a.insert(2, UChar{u'e'}); }, u"ade", nullptr},
+        {"prepend", u"ad", [](UCharArray &a) { a.prepend(UChar{u'_'}); }, u"_ad", nullptr},
+        {"insert at size + 1", u"ad", [&](UCharArray &a) { a.insert(3, bc, 2); }, u"ad", "insert"},
+        {"remove inside", u"abcde", [](UCharArray &a) { a.remove(1, 2); }, u"ade", nullptr},
+        {"remove nothing at size", u"ade", [](UCharArray &a) { a.remove(3, 0); }, u"ade", nullptr},
+        {"remove at size", u"ade", [](UCharArray &a) { a.remove(3); }, u"ade", "remove"},
+        {"remove wrapping", u"ade", [](UCharArray &a) { a.remove(1, UINT32_MAX); }, u"ade", "remove"},
+    };
+    for (const auto &[what, start, op, expected, site] : rows) {
+        dpxtest::TraceCapture trace(TRC1_ERROR | TRC1_ENTRY);
+        UCharArray array = array_of(start);
+        if (site != nullptr)
+            EXPECT_THROW(op(array), IndexOutOfBoundsException) << what;
+        else
+            op(array);
+        EXPECT_EQ(trace.count(" ENTER"), site ? 1u : 0u) << what;
+        EXPECT_EQ(trace.count("IndexOutOfBounds in " + std::string(site ? site : "") + ":"), site ? 1u : 0u) << what;
+        EXPECT_EQ(content(array), expected) << what;
+    }
 }
 
-TEST(IndexOutOfBoundsExceptionText, NamesLineAndFileAndAlwaysFits)
+TEST(UCharArray, TheExceptionNamesLineAndFileAndAlwaysFitsItsMessage)
 {
     EXPECT_STREQ(IndexOutOfBoundsException(176, "f").message, "line: 176, file: f");
     std::string path = "/" + std::string(2000, 'd') + "/dpxarray.cc";
-    IndexOutOfBoundsException cut(176, path.c_str());
-    EXPECT_EQ(std::string(cut.message).size(), 511u);
-    EXPECT_EQ(std::string(cut.message).rfind("line: 176, file: /ddd", 0), 0u);
-}
-
-TEST(IndexOutOfBoundsExceptionText, EachThrowSiteTracesItsOwnLineBeforeThrowing)
-{
-    dpxtest::TraceCapture trace(TRC1_ERROR | TRC1_ENTRY);
-    UCharArray array = array_of(u"ab");
-    const UChar unit = u'x';
-    struct Site {
-        const char *operation;
-        std::function<void()> fail;
-    };
-    const Site sites[] = {
-        {"operator[]", [&] { array[2]; }},
-        {"insert", [&] { array.insert(3, &unit, 1); }},
-        {"remove", [&] { array.remove(2, 1); }},
-    };
-    for (const Site &site : sites) {
-        int line = thrown_line(site.fail);
-        std::string where = std::string(site.operation) + ":" + std::to_string(line);
-        EXPECT_TRUE(trace.contains("dpxarray " + where + " ENTER")) << where;
-        EXPECT_TRUE(trace.contains("IndexOutOfBounds in " + where)) << trace.text();
-    }
-    EXPECT_EQ(content(array), u"ab");
+    std::string cut = IndexOutOfBoundsException(176, path.c_str()).message;
+    EXPECT_EQ(cut.size(), 511u);
+    EXPECT_EQ(cut.rfind("line: 176, file: /ddd", 0), 0u);
 }

@@ -6,27 +6,23 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <functional>
 #include <string>
-#include <vector>
+#include <tuple>
+#include <utility>
 
-using DPX::IndexOutOfBoundsException;
-using DPX::String;
-using DPX::UChar;
+using namespace DPX;
 
-namespace {
-
-// A string built from units as they stand, 0 units included.
-String text(std::u16string_view s)
+// A string of the units as they stand, 0 units included.
+static String text(std::u16string_view s)
 {
-    std::vector<UChar> v(s.begin(), s.end());
-    String r;
-    r.assign(v.data(), static_cast<uint32_t>(v.size()));
-    return r;
+    String result;
+    for (char16_t c : s)
+        result.append(static_cast<UChar>(c));
+    return result;
 }
 
-std::u16string u16(const String &s)
+static std::u16string u16(const String &s)
 {
     return std::u16string(s.getData(), s.getData() + s.length());
 }
@@ -35,264 +31,133 @@ std::u16string u16(const String &s)
 struct Probe : String {
     using String::String;
     uint32_t capacity() const { return units.getCapacity(); }
-    uint32_t array_size() const { return units.getSize(); }
 };
 
-}  // namespace
-
-TEST(StringStorage, TheEmptyStringHoldsOnlyItsTerminator)
+TEST(String, StorageHoldsTextAndTerminatorInExactlyTheCapacityRequested)
 {
-    Probe empty;
-    EXPECT_EQ(empty.length(), 0u);
-    EXPECT_EQ(empty.getData()[0], 0);
-    EXPECT_EQ(empty.array_size(), 1u);
-    EXPECT_EQ(empty.capacity(), 8u);
-    EXPECT_EQ(String(static_cast<const char *>(nullptr)).length(), 0u);
-    EXPECT_EQ(String(static_cast<const UChar *>(nullptr)).length(), 0u);
-    EXPECT_EQ(String::createUnicodeString(nullptr), nullptr);
-    EXPECT_STREQ(String().c_str(), "");
-}
-
-TEST(StringStorage, AssignmentReservesTextAndTerminatorAndACopyKeepsTheCapacity)
-{
-    Probe hundred(std::string(100, 'q').c_str());
-    EXPECT_EQ(hundred.length(), 100u);
-    EXPECT_EQ(hundred.capacity(), 101u);
+    Probe empty, hundred(std::string(100, 'q').c_str()), blanks(std::string(30, ' ').c_str());
     Probe copy(hundred);
     hundred.clear();
-    EXPECT_EQ(hundred.capacity(), 8u);
-    hundred.assign("abc");
-    EXPECT_EQ(hundred.capacity(), 8u);
-    EXPECT_EQ(copy.capacity(), 101u);
-}
-
-TEST(StringStorage, CountedSourcesStopAtTheirCountOrTheirEnd)
-{
-    EXPECT_EQ(u16(String("abc", 2)), u"ab");
-    EXPECT_EQ(u16(String("ab", 5)), u"ab");
-    EXPECT_EQ(u16(String(String("abc"), 2)), u"ab");
-    EXPECT_EQ(u16(String(String("abc"), 9)), u"abc");
-    String with_zero = text(std::u16string(u"a\0b", 3));
-    EXPECT_EQ(with_zero.length(), 3u);
-    EXPECT_EQ(String::compare(with_zero, text(u"a")), 0);  // compare stops at the 0 unit
-    UChar *copy = String::copyUnicodeString(String("xyz").getData());
-    EXPECT_EQ(std::u16string(copy, copy + 4), std::u16string(u"xyz\0", 4));
-    String::releaseUnicodeString(copy);
-}
-
-TEST(StringStorage, SelfAssignmentChangesNothing)
-{
-    String s("abc");
-    const String &self = s;
-    s = self;
-    EXPECT_EQ(u16(s), u"abc");
-    s.assign(self, 2);
-    EXPECT_EQ(u16(s), u"ab");
-    DPX::CharStar chars = s.c_str();
-    const DPX::CharStar &same = chars;
-    chars = same;
-    EXPECT_STREQ(chars, "ab");
-}
-
-TEST(StringCompare, GivesTheUnitDifferenceOrThePrefixOrder)
-{
-    struct Row {
-        std::u16string_view a, b;
-        int expected;
-    };
-    const Row rows[] = {{u"a", u"ab", -1}, {u"ab", u"a", 1}, {u"a", u"c", -2}, {u"", u"", 0}, {u"abc", u"abc", 0}};
-    for (const Row &row : rows)
-        EXPECT_EQ(String::compare(text(row.a), text(row.b)), row.expected);
-    EXPECT_TRUE(String("ab") == "ab");
-    EXPECT_TRUE("ab" == String("ab"));
-    EXPECT_TRUE(String("ab") != String("abc"));
-    EXPECT_EQ(u16(String("ab") + String("cd")), u"abcd");
-}
-
-TEST(StringBounds, EveryOperationThrowsExactlyAtItsBoundAndLeavesTheText)
-{
-    struct Row {
-        const char *what;
-        std::u16string_view start;
-        std::function<void(String &)> op;
-        bool throws;
-    };
-    const String xy("xy");
-    const Row rows[] = {
-        {"[length] is the terminator", u"abc", [](String &s) { EXPECT_EQ(s[3], 0); }, false},
-        {"[length + 1]", u"abc", [](String &s) { s[4]; }, true},
-        {"const [length + 1]", u"abc", [](String &s) { static_cast<const String &>(s)[4]; }, true},
-        {"append(s, length of s)", u"abc", [&](String &s) { s.append(xy, 2); }, false},
-        {"append(s, above its length)", u"abc", [&](String &s) { s.append(xy, 3); }, true},
-        {"erase(0, 0)", u"abc", [](String &s) { s.erase(0, 0); }, true},
-        {"erase to the end", u"abc", [](String &s) { s.erase(1, 2); }, false},
-        {"erase past the end", u"abc", [](String &s) { s.erase(2, 2); }, true},
-        {"erase(pos) at length", u"abc", [](String &s) { s.erase(3); }, true},
-        {"erase(pos) below length", u"abc", [](String &s) { s.erase(2); }, false},
-        {"substr(0, 0)", u"abc", [](String &s) { s.substr(0, 0); }, true},
-        {"substr to the end", u"abc", [](String &s) { s.substr(1, 2); }, false},
-        {"substr wrapping", u"abc", [](String &s) { s.substr(UINT32_MAX, 2); }, true},
-        {"substr(pos) at length", u"abc", [](String &s) { s.substr(3); }, true},
-        {"substr(0) of empty", u"", [](String &s) { s.substr(0); }, true},
-        {"find unit at length", u"abc", [](String &s) { s.find(UChar{'a'}, 3); }, true},
-        {"find unit in empty", u"", [](String &s) { s.find(UChar{'a'}, 0); }, true},
-        {"find char at length", u"abc", [](String &s) { s.find('a', 3); }, true},
-        {"find escaped at length", u"abc", [](String &s) { s.find(UChar{'a'}, UChar{'\\'}, 3); }, true},
-        {"find string at length", u"abc", [](String &s) { EXPECT_EQ(s.find(String("c"), 3), String::NPOS); }, false},
-        {"find empty string", u"abc", [](String &s) { EXPECT_EQ(s.find(String(), 0), String::NPOS); }, false},
-        {"rfind in empty", u"", [](String &s) { EXPECT_EQ(s.rfind(UChar{'a'}), String::NPOS); }, false},
-    };
-    for (const Row &row : rows) {
-        String s = text(row.start);
-        if (row.throws) {
-            EXPECT_THROW(row.op(s), IndexOutOfBoundsException) << row.what;
-            EXPECT_EQ(u16(s), row.start) << row.what;
-        } else {
-            EXPECT_NO_THROW(row.op(s)) << row.what;
-        }
-    }
-}
-
-TEST(StringBounds, AThrowSiteTracesAndNamesItsLineInThisLibrary)
-{
-    dpxtest::TraceCapture trace(TRC1_ERROR);
-    String s("abc");
-    try {
-        s.erase(0, 0);
-        FAIL() << "no exception";
-    } catch (const IndexOutOfBoundsException &e) {
-        int line = 0;
-        ASSERT_EQ(std::sscanf(e.message, "line: %d, file: ", &line), 1);
-        EXPECT_NE(std::string(e.message).find("dpxstr.cc"), std::string::npos);
-        EXPECT_TRUE(trace.contains("dpxstr erase:" + std::to_string(line) +
-                                   " IndexOutOfBounds occurred, throwing exception"))
-            << trace.text();
-    }
-}
-
-TEST(StringFind, FindsUnitsCharactersAndStrings)
-{
-    String s = text(u"abcab\xFF80");
-    EXPECT_EQ(s.find(UChar{'b'}, 0), 1u);
-    EXPECT_EQ(s.find(UChar{'b'}, 2), 4u);
-    EXPECT_EQ(s.find(UChar{'z'}, 0), String::NPOS);
-    EXPECT_EQ(s.find('\x80', 0), 5u);  // widened with its sign
-    EXPECT_EQ(s.find(String("ca"), 0), 2u);
-    EXPECT_EQ(s.find(String("ab"), 1), 3u);
-    EXPECT_EQ(s.find(String("ab"), 4), String::NPOS);
-    EXPECT_EQ(s.find(String("abcab!!"), 0), String::NPOS);
-    EXPECT_EQ(s.rfind(UChar{'a'}), 3u);
-    EXPECT_EQ(s.rfind(0), 6u);
-    EXPECT_EQ(String().rfind(0), 0u);
-}
-
-TEST(StringFind, AnEscapedUnitIsSkippedAndEscapesEscapeEachOther)
-{
-    struct Row {
-        std::u16string_view text;
-        uint32_t pos;
-        uint32_t expected;
-    };
-    const Row rows[] = {
-        {u"\\\"", 0, String::NPOS},     {u"\\\\\"", 0, 2},  {u"\\\\\\\"", 0, String::NPOS},
-        {u"a\"", 0, 1},                 {u"\"", 0, 0},      {u"\\\"x\"", 0, 3},
-        {u"\\\\\\\\\"", 0, 4},          {u"\"a\"", 1, 2},
-    };
-    for (const Row &row : rows)
-        EXPECT_EQ(text(row.text).find(UChar{'"'}, UChar{'\\'}, row.pos), row.expected)
-            << std::string(row.text.begin(), row.text.end());
-}
-
-TEST(StringEdit, AppendEraseAndSubstrWorkOnUnits)
-{
-    String s("ab");
-    s.append(s);
-    EXPECT_EQ(u16(s), u"abab");
-    s.append(UChar{0x263A});
-    EXPECT_EQ(u16(s), u"abab\x263A");
-    EXPECT_EQ(s.getData()[s.length()], 0);
-    EXPECT_EQ(u16(s.substr(1, 2)), u"ba");
-    EXPECT_EQ(u16(s.substr(3)), u"b\x263A");
-    EXPECT_EQ(u16(s.erase(1, 2)), u"ab\x263A");
-    EXPECT_EQ(u16(s.erase(1)), u"a");
-}
-
-TEST(StringEdit, TrimRemovesOuterWhiteSpaceOnly)
-{
-    Probe s("  a b  ");
-    s.trim();
-    EXPECT_EQ(u16(s), u"a b");
-    Probe blanks(std::string(30, ' ').c_str());
     blanks.trim();
-    EXPECT_EQ(blanks.length(), 0u);
-    EXPECT_EQ(blanks.capacity(), 8u);
-    EXPECT_EQ(u16(String("\t x").trim()), u"x");
-    EXPECT_EQ(u16(String("x \n").trim()), u"x");
-    EXPECT_EQ(u16(String().trim()), u"");
+    for (const Probe *eight : {&empty, &hundred, &blanks})
+        EXPECT_EQ(std::pair(eight->length(), eight->capacity()), std::pair(0u, 8u));
+    EXPECT_EQ(std::pair(copy.length(), copy.capacity()), std::pair(100u, 101u));
+    EXPECT_STREQ(empty.c_str(), "");
+    EXPECT_TRUE(String(static_cast<const char *>(nullptr)) == "" && String(static_cast<const UChar *>(nullptr)) == "");
+    EXPECT_EQ(String::createUnicodeString(nullptr), nullptr);
+    EXPECT_TRUE(String("abc", 2) == "ab" && String("ab", 5) == "ab");
+    String s("abc");
+    s = static_cast<const String &>(s);
+    CharStar chars = s.c_str();
+    chars = static_cast<const CharStar &>(chars);
+    EXPECT_STREQ(chars, "abc");
 }
 
-TEST(StringEdit, RemoveEscapesDropsTheLastEscapeOfEachRun)
+TEST(String, CompareGivesTheUnitDifferenceOrThePrefixOrderUpToTheFirstZero)
 {
-    const std::pair<const char *, std::u16string_view> rows[] = {
-        {"axb", u"ab"}, {"axxb", u"axb"}, {"axxxb", u"axxb"}, {"ax", u"a"}, {"x", u""}, {"xx", u"x"}, {"xaxb", u"ab"},
+    const std::tuple<std::u16string_view, std::u16string_view, int> rows[] = {
+        {u"a", u"ab", -1}, {u"ab", u"a", 1}, {u"a", u"c", -2}, {u"", u"", 0},
+        {std::u16string_view(u"a\0b", 3), u"a", 0}};
+    for (const auto &[a, b, expected] : rows)
+        EXPECT_EQ(String::compare(text(a), text(b)), expected);
+}
+
+TEST(String, EveryOperationChecksItsBoundAndAFailureTracesAndLeavesTheText)
+{
+    using Op = std::function<void(String &)>;
+    // What, start, operation, the text after it, whether it throws.
+    const std::tuple<const char *, std::u16string_view, Op, std::u16string_view, bool> rows[] = {
+        {"[length] is the terminator", u"abc", [](String &s) { EXPECT_EQ(s[3], 0); }, u"abc", false},
+        {"[length + 1]", u"abc", [](String &s) { s[4]; }, u"abc", true},
+        {"const [length + 1]", u"abc", [](String &s) { static_cast<const String &>(s)[4]; }, u"abc", true},
+        {"append itself", u"abc", [](String &s) { s.append(s); }, u"abcabc", false},
+        {"escape the units of itself", u"ab", [](String &s) { s.insertEscapes(UChar{'x'}, s); }, u"xaxb", false},
+        {"append(s, length of s)", u"abc", [](String &s) { s.append(String("xy"), 2); }, u"abcxy", false},
+        {"append(s, above its length)", u"abc", [](String &s) { s.append(String("xy"), 3); }, u"abc", true},
+        {"erase(0, 0)", u"abc", [](String &s) { s.erase(0, 0); }, u"abc", true},
+        {"erase to the end", u"abc", [](String &s) { s.erase(1, 2); }, u"a", false},
+        {"erase past the end", u"abc", [](String &s) { s.erase(2, 2); }, u"abc", true},
+        {"erase(pos) at length", u"abc", [](String &s) { s.erase(3); }, u"abc", true},
+        {"erase(pos) below length", u"abc", [](String &s) { s.erase(2); }, u"ab", false},
+        {"substr(0, 0)", u"abc", [](String &s) { s.substr(0, 0); }, u"abc", true},
+        {"substr to the end", u"abc", [](String &s) { s = s.substr(1, 2); }, u"bc", false},
+        {"substr wrapping", u"abc", [](String &s) { s.substr(UINT32_MAX, 2); }, u"abc", true},
+        {"substr(pos) at length", u"abc", [](String &s) { s.substr(3); }, u"abc", true},
+        {"substr(pos)", u"abc", [](String &s) { s = s.substr(2); }, u"c", false},
+        {"substr(0) of empty", u"", [](String &s) { s.substr(0); }, u"", true},
+        {"find unit at length", u"abc", [](String &s) { s.find(UChar{'a'}, 3); }, u"abc", true},
+        {"find unit in empty", u"", [](String &s) { s.find(UChar{'a'}, 0); }, u"", true},
+        {"find char at length", u"abc", [](String &s) { s.find('a', 3); }, u"abc", true},
+        {"find escaped at length", u"abc", [](String &s) { s.find(UChar{'a'}, UChar{'\\'}, 3); }, u"abc", true},
+        {"find s at length", u"abc", [](String &s) { EXPECT_EQ(s.find(String("c"), 3), String::NPOS); }, u"abc", false},
+        {"find empty s", u"abc", [](String &s) { EXPECT_EQ(s.find(String(), 0), String::NPOS); }, u"abc", false},
+        {"rfind in empty", u"", [](String &s) { EXPECT_EQ(s.rfind(UChar{'a'}), String::NPOS); }, u"", false},
     };
-    for (const auto &[input, expected] : rows)
-        EXPECT_EQ(u16(String(input).removeEscapes(UChar{'x'})), expected) << input;
+    for (const auto &[what, start, op, expected, throws] : rows) {
+        dpxtest::TraceCapture trace(TRC1_ERROR);
+        String s = text(start);
+        if (throws)
+            EXPECT_THROW(op(s), IndexOutOfBoundsException) << what;
+        else
+            op(s);
+        EXPECT_EQ(trace.count("IndexOutOfBounds occurred, throwing exception"), throws ? 1u : 0u) << what;
+        EXPECT_EQ(u16(s), expected) << what;
+    }
 }
 
-TEST(StringEdit, InsertEscapesMarksEveryMemberOfTheSet)
+TEST(String, TheFindFamilyGivesTheFirstOrLastHitAndSkipsAUnitBehindAnOddRunOfEscapes)
 {
+    const String s = text(u"abcab\xFF80");
+    const std::pair<uint32_t, uint32_t> found[] = {
+        {s.find(UChar{'b'}, 2), 4}, {s.find(UChar{'z'}, 0), String::NPOS},
+        {s.find('\x80', 0), 5}, {s.find(String("ab"), 1), 3},  // a char is widened with its sign
+        {s.find(String("ab"), 4), String::NPOS}, {s.find(String("abcab!!"), 0), String::NPOS},
+        {s.rfind(UChar{'a'}), 3}, {s.rfind(0), 6}, {String().rfind(0), 0}};
+    for (size_t row = 0; row < std::size(found); ++row)
+        EXPECT_EQ(found[row].first, found[row].second) << "row " << row;
+    const std::tuple<std::u16string_view, uint32_t, uint32_t> escaped[] = {
+        {u"\\\"", 0, String::NPOS}, {u"\\\\\"", 0, 2}, {u"\\\\\\\"", 0, String::NPOS}, {u"a\"", 0, 1},
+        {u"\"", 0, 0}, {u"\\\"x\"", 0, 3}, {u"\\\\\\\\\"", 0, 4}, {u"\"a\"", 1, 2}};
+    for (const auto &[input, pos, expected] : escaped)
+        EXPECT_EQ(text(input).find(UChar{'"'}, UChar{'\\'}, pos), expected) << std::string(input.begin(), input.end());
+}
+
+TEST(String, TrimAndEscapingRewriteTheText)
+{
+    EXPECT_EQ(u16(String("  a b  ").trim()), u"a b");
+    EXPECT_EQ(u16(String("\t x \n").trim()), u"x");
+    const std::pair<const char *, std::u16string_view> unescaped[] = {
+        {"axb", u"ab"}, {"axxb", u"axb"}, {"axxxb", u"axxb"}, {"ax", u"a"}, {"xx", u"x"}, {"xaxb", u"ab"}};
+    for (const auto &[input, expected] : unescaped)
+        EXPECT_EQ(u16(String(input).removeEscapes(UChar{'x'})), expected) << input;
     EXPECT_EQ(u16(String("cab").insertEscapes(UChar{'x'}, String("ab"))), u"cxaxb");
     EXPECT_EQ(u16(String("axb").insertEscapes(UChar{'x'}, String("ab"))), u"xaxxb");
     EXPECT_EQ(u16(String("axb").insertEscapes(UChar{'x'}, String("x"))), u"axxb");
-    // A 0 unit in the set matches the terminator too.
-    EXPECT_EQ(u16(String("ab").insertEscapes(UChar{'x'}, text(std::u16string(u"\0", 1)))), u"abx");
-    String self("ab");
-    EXPECT_EQ(u16(self.insertEscapes(UChar{'x'}, self)), u"xaxb");
+    EXPECT_EQ(u16(String("ab").insertEscapes(UChar{'x'}, text(std::u16string(1, 0)))), u"abx");  // the terminator
 }
 
-TEST(StringReplace, ReplacesEveryOccurrenceFromTheLeftAndTracesItsWork)
+TEST(String, ReplaceReplacesEveryOccurrenceFromTheLeftAndTracesItsWork)
 {
     dpxtest::TraceCapture trace(TRC1_FLOW);
-    struct Row {
-        const char *s, *from, *to, *expected;
-    };
-    const Row rows[] = {
-        {"aXa", "a", "bb", "bbXbb"}, {"aaa", "aa", "b", "ba"}, {"", "x", "y", ""},
-        {"abc", "", "z", "abc"},     {"abab", "ab", "", ""},   {"xyz", "q", "r", "xyz"},
-    };
-    for (const Row &row : rows)
-        EXPECT_TRUE(String::replace(String(row.s), String(row.from), String(row.to)) == row.expected) << row.s;
-    EXPECT_TRUE(trace.contains("Str [aXa], replace [a] with [bb]")) << trace.text();
-    EXPECT_TRUE(trace.contains("Returning [bbXbb]"));
+    const std::tuple<const char *, const char *, const char *, const char *> rows[] = {
+        {"aXa", "a", "bb", "bbXbb"}, {"aaa", "aa", "b", "ba"}, {"", "x", "y", ""}, {"abc", "", "z", "abc"},
+        {"abab", "ab", "", ""}, {"xyz", "q", "r", "xyz"}, {"ab", "b", "bb", "abb"}};
+    for (const auto &[s, from, to, expected] : rows)
+        EXPECT_TRUE(String::replace(String(s), String(from), String(to)) == expected) << s;
+    EXPECT_TRUE(trace.contains("Str [aXa], replace [a] with [bb]") && trace.contains("Returning [bbXbb]"));
 }
 
-TEST(StringConvertToInt, AcceptsAWholeDecimalNumberBetweenTheLongLimits)
+TEST(String, ConvertToIntAcceptsAWholeDecimalNumberStrictlyInsideTheLongLimits)
 {
     dpxtest::TraceCapture trace(TRC1_ERROR);
-    struct Row {
-        const char *text;
-        bool accepted;
-        int32_t value;
-    };
-    const Row rows[] = {
-        {"42", true, 42},
-        {" -7", true, -7},
-        {"", true, 0},
-        {"   ", false, 0},
-        {"12 ", false, 0},
-        {"12a", false, 0},
-        {"2147483646", true, 2147483646},
-        {"2147483647", false, 0},
-        {"-2147483647", true, -2147483647},
-        {"-2147483648", false, 0},
-        {"12345678901", false, 0},
-        {"-99999999999", false, 0},
-    };
-    for (const Row &row : rows) {
+    const std::tuple<const char *, bool, int32_t> rows[] = {
+        {"42", true, 42}, {" -7", true, -7}, {"", true, 0}, {"   ", false, 0}, {"12 ", false, 0}, {"12a", false, 0},
+        {"2147483646", true, 2147483646}, {"2147483647", false, 0}, {"-2147483647", true, -2147483647},
+        {"-2147483648", false, 0}, {"12345678901", false, 0}, {"-99999999999", false, 0}};
+    for (const auto &[s, accepted, value] : rows) {
         int32_t out = 99;
-        EXPECT_EQ(String::convertToInt(String(row.text), &out), row.accepted) << row.text;
-        EXPECT_EQ(out, row.value) << row.text;
+        EXPECT_EQ(String::convertToInt(String(s), &out), accepted) << s;
+        EXPECT_EQ(out, value) << s;
     }
     EXPECT_TRUE(trace.contains("Can't convert, number is too large: 12345678901"));
     EXPECT_TRUE(trace.contains("Can't convert, buffer is not number: 12a"));
