@@ -38,6 +38,7 @@ constexpr uint32_t kDefaultConnectTimeoutMs = 5000;
 constexpr uint32_t kDefaultCallTimeoutMs = 120000;
 // Idle connections kept, over all addresses; the oldest goes first.
 constexpr size_t kMaxIdle = 64;
+constexpr uint32_t kDefaultClientIdleS = 60;
 
 [[noreturn]] void raise(uint32_t status)
 {
@@ -82,6 +83,8 @@ public:
     Connection &operator=(const Connection &) = delete;
 
     const std::string &key() const { return key_; }
+    Clock::time_point idle_since() const { return idle_since_; }
+    void mark_idle() { idle_since_ = Clock::now(); }
 
     asio::error_code connect(const tcp::endpoint &endpoint, Clock::time_point deadline)
     {
@@ -142,9 +145,14 @@ private:
     asio::io_context io_{1};
     tcp::socket socket_{io_};
     std::string key_;
+    Clock::time_point idle_since_{};
 };
 
-// Idle connections, newest last.
+// Idle connections, newest last. A connection idle for longer than the
+// client's limit ("NCS_CLIENT_IDLE_S", 60 s by default, well below the
+// server's 300 s) is closed rather than reused: a server that closes an idle
+// connection just as a call starts on it would fail a call that is not
+// repeated, and connections to servers that are gone don't linger.
 class Pool {
 public:
     // An idle connection to `key` that is still open, or null.
@@ -152,8 +160,10 @@ public:
     {
         for (;;) {
             std::unique_ptr<Connection> connection;
+            std::deque<std::unique_ptr<Connection>> expired;
             {
                 std::lock_guard<std::mutex> hold(mutex_);
+                expire(expired);
                 for (auto it = idle_.rbegin(); it != idle_.rend(); ++it) {
                     if ((*it)->key() == key) {
                         connection = std::move(*it);
@@ -170,7 +180,10 @@ public:
     void give(std::unique_ptr<Connection> connection)
     {
         std::unique_ptr<Connection> dropped;
+        std::deque<std::unique_ptr<Connection>> expired;
+        connection->mark_idle();
         std::lock_guard<std::mutex> hold(mutex_);
+        expire(expired);
         idle_.push_back(std::move(connection));
         if (idle_.size() > kMaxIdle) {
             dropped = std::move(idle_.front());
@@ -179,6 +192,19 @@ public:
     }
 
 private:
+    // Moves the connections idle for too long, the oldest first, to `expired`;
+    // they are closed by its destructor, after the lock is released.
+    // REQUIRES: mutex_ held.
+    void expire(std::deque<std::unique_ptr<Connection>> &expired)
+    {
+        auto limit = std::chrono::seconds(ncs::setting("NCS_CLIENT_IDLE_S", kDefaultClientIdleS));
+        auto now = Clock::now();
+        while (!idle_.empty() && now - idle_.front()->idle_since() > limit) {
+            expired.push_back(std::move(idle_.front()));
+            idle_.pop_front();
+        }
+    }
+
     std::mutex mutex_;  // guards idle_; never held during socket operations
     std::deque<std::unique_ptr<Connection>> idle_;
 };
