@@ -1,5 +1,5 @@
-// Helpers of the file-layer and transfer suites: a cx_ file that closes
-// itself, and a cx_status that reads well in an assertion.
+// Helpers of the file-layer and transfer suites: a cx_status that reads well
+// in an assertion, and a cx_ file that closes itself.
 #ifndef DPX_TESTS_CX_TEST_FILE_H
 #define DPX_TESTS_CX_TEST_FILE_H
 
@@ -8,6 +8,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <utility>
 
 namespace dpxtest {
 
@@ -20,41 +21,28 @@ inline testing::AssertionResult cx_is(cx_status status, char category, int32_t c
                                        << code;
 }
 
-inline testing::AssertionResult cx_ok(cx_status status)
-{
-    return cx_is(status, CX_CATEGORY_OK, 0);
-}
+inline testing::AssertionResult cx_ok(cx_status status) { return cx_is(status, CX_CATEGORY_OK, 0); }
 
-// A cx_os_file_t opened through cx_open_file and closed at the end of the
-// scope, or wrapping a stream that the test opened itself.
-class CxFile {
-public:
-    CxFile() = default;
-    explicit CxFile(FILE *stream) : file_{stream}, open_(stream != nullptr) {}
+// A cx_os_file_t, opened through cx_open_file or wrapping a stream that the
+// test opened itself, and closed at the end of the scope.
+struct CxFile {
+    explicit CxFile(FILE *stream = nullptr) : file{stream} {}
     ~CxFile() { close(); }
     CxFile(const CxFile &) = delete;
     CxFile &operator=(const CxFile &) = delete;
-
     cx_status open(const std::string &path, int32_t mode)
     {
         close();
-        cx_status status = cx_open_file(path.c_str(), &file_, mode);
-        open_ = status.category == CX_CATEGORY_OK;
-        return status;
+        return cx_open_file(path.c_str(), &file, mode);
     }
     cx_status close()
     {
-        cx_status status = {CX_CATEGORY_OK, 0};
-        if (open_)
-            status = cx_close_file(&file_);
-        open_ = false;
-        return status;
+        cx_os_file_t open{std::exchange(file.stream, nullptr)};
+        return open.stream != nullptr ? cx_close_file(&open) : cx_status{CX_CATEGORY_OK, 0};
     }
-    cx_os_file_t *get() { return &file_; }
+    cx_os_file_t *get() { return &file; }
 
-private:
-    cx_os_file_t file_{};
-    bool open_ = false;
+    cx_os_file_t file;
 };
 
 }  // namespace dpxtest

@@ -1,230 +1,176 @@
-// Reading a file into transfer buffers and writing buffers back, on real
-// files, sparse ones of more than 4 GiB included.
+// Reading a file into transfer buffers and writing buffers back, and the
+// identity of a file across the calls of a transfer, on real files, sparse
+// ones of more than 4 GiB included.
 #include "cx_test_file.h"
 #include "test_support.h"
 #include "trc/trc1.h"
 
-#include <gtest/gtest.h>
-
-#include <cstdio>
 #include <fcntl.h>
-#include <string>
 #include <sys/stat.h>
+#include <tuple>
 #include <unistd.h>
 #include <vector>
 
-using dpxtest::cx_ok;
-using dpxtest::CxFile;
-using dpxtest::TempDir;
+using namespace dpxtest;
 
 namespace {
 
-constexpr int16_t kMax = 23;
-constexpr uint32_t kChunk = DPX_CHUNK_SIZE;
+// What one read call reports: last, finished and index.
+using Call = std::tuple<int, int, uint32_t>;
 
-// What one read call reports.
-struct Call {
-    int16_t last;
-    uint8_t finished;
-    uint32_t index;
-    bool operator==(const Call &) const = default;
-};
-
-std::ostream &operator<<(std::ostream &out, const Call &call)
+// One read call from `index`. The out-arguments start as a sentinel that no read gives.
+Call read_call(CxFile &file, uint32_t index, std::vector<dpx_chunk> &buffer, int16_t max, dpx_status *status)
 {
-    return out << "{last " << call.last << ", finished " << int{call.finished} << ", index " << call.index << "}";
+    int16_t last = -7;
+    uint8_t finished = 0x5A;
+    *status = dpx_read_xfer_buff(file.get(), &index, buffer.data(), &last, max, &finished);
+    return {last, finished, index};
 }
 
-// A sentinel that no read reports, to see that nothing was written.
-constexpr Call kUntouched = {-7, 0x5A, 0xDEADBEEF};
-
-Call read_call(cx_os_file_t *file, uint32_t index, std::vector<dpx_chunk> &buffer, int16_t max, dpx_status *status)
+// Makes `path` a (sparse) file of `length` bytes, modified at this time.
+void make_file(const std::string &path, uint64_t length, time_t seconds, long nanoseconds)
 {
-    Call call = kUntouched;
-    call.index = index;
-    *status = dpx_read_xfer_buff(file, &call.index, buffer.data(), &call.last, max, &call.finished);
-    return call;
+    const struct timespec times[2] = {{seconds, 0}, {seconds, nanoseconds}};
+    close(open(path.c_str(), O_CREAT | O_WRONLY, 0600));
+    EXPECT_TRUE(truncate(path.c_str(), off_t(length)) == 0 && utimensat(AT_FDCWD, path.c_str(), times, 0) == 0);
 }
 
-dpx_chunk record_of(const std::string &bytes)
+TEST(XferRead, FillsRecordsFromTheIndexAndFindsTheEndOnlyByAShortRead)
 {
-    dpx_chunk record{};
-    record.length = static_cast<uint32_t>(bytes.size());
-    bytes.copy(reinterpret_cast<char *>(record.data), bytes.size());
-    return record;
-}
-
-}  // namespace
-
-TEST(XferRead, ReadsWholeFilesIntoRecordsAndFindsTheEndOnlyByAShortRead)
-{
-    struct Case {
-        size_t size;
-        std::vector<Call> calls;
-    };
-    const Case cases[] = {
-        {0, {{0, 1, 1}}},
-        {4095, {{0, 1, 1}}},
-        {4096, {{1, 1, 2}}},
-        {5000, {{1, 1, 2}}},
-        {24 * 4096, {{23, 0, 24}, {0, 1, 25}}},
-    };
-    for (const Case &c : cases) {
-        SCOPED_TRACE(c.size);
+    const struct { size_t size; uint32_t index; int16_t max; std::vector<Call> calls; } cases[] = {
+        {0, 0, 23, {{0, 1, 1}}}, {4095, 0, 23, {{0, 1, 1}}}, {4096, 0, 23, {{1, 1, 2}}}, {5000, 0, 23, {{1, 1, 2}}},
+        {24 * 4096, 0, 23, {{23, 0, 24}, {0, 1, 25}}}, {5000, 10, 23, {{0, 1, 11}}}, {5000, 1, -1, {{-1, 0, 1}}}};
+    for (const auto &c : cases) {
+        SCOPED_TRACE(testing::Message() << c.size << " bytes from chunk " << c.index << ", max " << c.max);
         TempDir tmp;
-        const std::string content = dpxtest::pattern_bytes(c.size);
-        dpxtest::write_file(tmp / "f", content);
+        const std::string content = pattern_bytes(c.size);
+        write_file(tmp / "f", content);
         CxFile file;
         ASSERT_TRUE(cx_ok(file.open(tmp / "f", CX_FILE_READ)));
-        std::vector<dpx_chunk> buffer(kMax + 1);
-        std::string got;
-        uint32_t index = 0;
+        std::vector<dpx_chunk> buffer(24);
+        uint32_t index = c.index;
         for (const Call &expected : c.calls) {
             dpx_status status = DPX_E_QUIET;
-            Call call = read_call(file.get(), index, buffer, kMax, &status);
+            ASSERT_EQ(read_call(file, index, buffer, c.max, &status), expected);
             ASSERT_EQ(status, DPX_OK);
-            ASSERT_EQ(call, expected);
-            for (int16_t i = 0; i <= call.last; ++i) {
-                EXPECT_EQ(buffer[i].index, index + static_cast<uint32_t>(i));
-                size_t offset = size_t{buffer[i].index} * kChunk;
-                EXPECT_EQ(buffer[i].length, std::min<size_t>(kChunk, c.size - offset));
-                got.append(reinterpret_cast<const char *>(buffer[i].data), buffer[i].length);
+            for (int i = 0; i <= std::get<0>(expected); ++i, ++index) {
+                EXPECT_EQ(buffer[i].index, index);
+                EXPECT_EQ(std::string(reinterpret_cast<const char *>(buffer[i].data), buffer[i].length),
+                          content.substr(std::min<size_t>(size_t{index} * 4096, c.size), 4096));
             }
-            index = call.index;
         }
-        EXPECT_EQ(got, content);
     }
-}
-
-TEST(XferRead, AnIndexPastTheEndGivesOneEmptyRecordAndMaxMinusOneReadsNothing)
-{
-    TempDir tmp;
-    dpxtest::write_file(tmp / "f", std::string(5000, 'x'));
-    CxFile file;
-    ASSERT_TRUE(cx_ok(file.open(tmp / "f", CX_FILE_READ)));
-    std::vector<dpx_chunk> buffer(kMax + 1);
-    dpx_status status = DPX_E_QUIET;
-    EXPECT_EQ(read_call(file.get(), 10, buffer, kMax, &status), (Call{0, 1, 11}));
-    EXPECT_EQ(status, DPX_OK);
-    EXPECT_EQ(buffer[0].index, 10u);
-    EXPECT_EQ(buffer[0].length, 0u);
-    EXPECT_EQ(read_call(file.get(), 1, buffer, -1, &status), (Call{-1, 0, 1}));
-    EXPECT_EQ(status, DPX_OK);
-    uint32_t index = 0;
-    int16_t last = 0;
-    EXPECT_EQ(dpx_read_xfer_buff(file.get(), &index, buffer.data(), &last, kMax, nullptr), DPX_E_INVALID_PARAM);
 }
 
 TEST(XferRead, AFailedSeekOrReadLeavesTheOutArgumentsAsTheyWere)
 {
     TempDir tmp;
-    ASSERT_EQ(mkdir((tmp / "dir").c_str(), 0700), 0);
     int pipe_ends[2];
     ASSERT_EQ(pipe(pipe_ends), 0);
     CxFile pipe_reader(fdopen(pipe_ends[0], "rb"));
     close(pipe_ends[1]);
     CxFile write_only;
     ASSERT_TRUE(cx_ok(write_only.open(tmp / "w", CX_FILE_WRITE)));
-    CxFile directory;
-    ASSERT_TRUE(cx_ok(directory.open(tmp / "dir", CX_FILE_READ)));
-    struct Case {
-        const char *what;
-        CxFile *file;
-        uint32_t index;
-        dpx_status status;
-        const char *trace;
-    };
-    const Case cases[] = {
-        {"pipe", &pipe_reader, 3, DPX_E_FILE_SEEK, "Can't seek file pos"},
-        {"write-only file", &write_only, 0, DPX_E_FILE_READ, "Can't read file"},
-        {"directory", &directory, 0, DPX_E_FILE_READ, "Can't read file"},
-    };
-    std::vector<dpx_chunk> buffer(kMax + 1);
-    for (const Case &c : cases) {
-        SCOPED_TRACE(c.what);
-        dpxtest::TraceCapture trace(TRC1_ERROR);
-        Call call = kUntouched;
-        call.index = c.index;
-        EXPECT_EQ(dpx_read_xfer_buff(c.file->get(), &call.index, buffer.data(), &call.last, kMax, &call.finished),
-                  c.status);
-        EXPECT_EQ(call, (Call{kUntouched.last, kUntouched.finished, c.index}));
-        EXPECT_EQ(trace.count(c.trace), 1u);
+    const struct { CxFile *file; uint32_t index; dpx_status status; const char *trace; } cases[] = {
+        {&pipe_reader, 3, DPX_E_FILE_SEEK, "Can't seek file pos\n"},
+        {&write_only, 0, DPX_E_FILE_READ, "Can't read file\n"}};
+    std::vector<dpx_chunk> buffer(24);
+    for (const auto &c : cases) {
+        TraceCapture trace(TRC1_ERROR);
+        dpx_status status = DPX_OK;
+        EXPECT_EQ(read_call(*c.file, c.index, buffer, 23, &status), Call(-7, 0x5A, c.index));
+        EXPECT_EQ(status, c.status);
+        EXPECT_EQ(trace.count(c.trace), 1u) << trace.text();
     }
 }
 
 TEST(XferRead, ChunksOnBothSidesOfTheTwoAndFourGiBBoundariesComeFromTheirPlace)
 {
     TempDir tmp;
-    const std::string path = tmp / "sparse";
-    const uint32_t below_2g = (1u << 19) - 1;
-    const uint32_t below_4g = (1u << 20) - 1;
-    const uint64_t size = (uint64_t{below_4g} + 3) * kChunk + 100;
-    int fd = open(path.c_str(), O_CREAT | O_WRONLY, 0600);
-    ASSERT_GE(fd, 0);
-    ASSERT_EQ(ftruncate(fd, static_cast<off_t>(size)), 0);
+    const uint32_t below_2g = (1u << 19) - 1, below_4g = (1u << 20) - 1;
+    make_file(tmp / "sparse", (uint64_t{below_4g} + 3) * 4096 + 100, 0, 0);
+    const int fd = open((tmp / "sparse").c_str(), O_WRONLY);
     for (uint32_t chunk : {below_2g, below_2g + 1, below_4g, below_4g + 1, below_4g + 3}) {
-        std::string mark = "chunk " + std::to_string(chunk);
-        ASSERT_EQ(pwrite(fd, mark.data(), mark.size(), static_cast<off_t>(uint64_t{chunk} * kChunk)),
-                  static_cast<ssize_t>(mark.size()));
+        const std::string mark = std::to_string(chunk);
+        EXPECT_EQ(pwrite(fd, mark.data(), mark.size(), off_t{chunk} * 4096), ssize_t(mark.size()));
     }
     close(fd);
-
     CxFile file;
-    ASSERT_TRUE(cx_ok(file.open(path, CX_FILE_READ)));
+    ASSERT_TRUE(cx_ok(file.open(tmp / "sparse", CX_FILE_READ)));
     std::vector<dpx_chunk> buffer(2);
-    auto text_of = [](const dpx_chunk &record) { return std::string(reinterpret_cast<const char *>(record.data)); };
+    // The zeros of the sparse file end each mark.
+    const auto mark = [&buffer](int i) { return std::string(reinterpret_cast<const char *>(buffer[i].data)); };
     dpx_status status = DPX_E_QUIET;
     for (uint32_t first : {below_2g, below_4g}) {
-        SCOPED_TRACE(first);
-        EXPECT_EQ(read_call(file.get(), first, buffer, 1, &status), (Call{1, 0, first + 2}));
-        EXPECT_EQ(status, DPX_OK);
-        EXPECT_EQ(text_of(buffer[0]), "chunk " + std::to_string(first));
-        EXPECT_EQ(text_of(buffer[1]), "chunk " + std::to_string(first + 1));
-        EXPECT_EQ(buffer[1].index, first + 1);
+        EXPECT_EQ(read_call(file, first, buffer, 1, &status), Call(1, 0, first + 2));
+        EXPECT_TRUE(mark(0) == std::to_string(first) && mark(1) == std::to_string(first + 1)) << first;
     }
-    EXPECT_EQ(read_call(file.get(), below_4g + 3, buffer, 1, &status), (Call{0, 1, below_4g + 4}));
-    EXPECT_EQ(buffer[0].length, 100u);
-    EXPECT_EQ(text_of(buffer[0]), "chunk " + std::to_string(below_4g + 3));
+    EXPECT_EQ(read_call(file, below_4g + 3, buffer, 1, &status), Call(0, 1, below_4g + 4));
+    EXPECT_TRUE(mark(0) == std::to_string(below_4g + 3) && buffer[0].length == 100);
 }
 
-TEST(XferWrite, WritesRecordsZeroToLastInOrderAndNothingForMinusOne)
+TEST(XferWrite, WritesRecordsZeroToLastInOrderOrNothingWhenOneClaimsMoreThanAChunk)
 {
     TempDir tmp;
-    const std::vector<dpx_chunk> buffer = {record_of("abc"), record_of(""), record_of(std::string(4096, 'z')),
-                                           record_of("never")};
-    for (int16_t last : {-1, 0, 2}) {
-        SCOPED_TRACE(last);
+    const std::string texts[] = {"abc", "", std::string(4096, 'z'), "long"};
+    std::vector<dpx_chunk> buffer(4);
+    for (size_t i = 0; i < 4; ++i)
+        buffer[i].length = static_cast<uint32_t>(texts[i].copy(reinterpret_cast<char *>(buffer[i].data), 4096));
+    buffer[3].length = DPX_CHUNK_SIZE + 1;
+    const struct { int16_t last; dpx_status status; std::string content; } rows[] = {
+        {-1, DPX_OK, ""}, {0, DPX_OK, "abc"}, {2, DPX_OK, "abc" + texts[2]}, {3, DPX_E_INVALID_PARAM, ""}};
+    for (const auto &row : rows) {
         CxFile file;
         ASSERT_TRUE(cx_ok(file.open(tmp / "out", CX_FILE_WRITE)));
-        EXPECT_EQ(dpx_write_xfer_buff(file.get(), buffer.data(), last), DPX_OK);
+        EXPECT_EQ(dpx_write_xfer_buff(file.get(), buffer.data(), row.last), row.status) << row.last;
         ASSERT_TRUE(cx_ok(file.close()));
-        const std::string expected[] = {"", "abc", "abc" + std::string(4096, 'z')};
-        EXPECT_EQ(dpxtest::read_file(tmp / "out"), expected[last == -1 ? 0 : last == 0 ? 1 : 2]);
+        EXPECT_EQ(read_file(tmp / "out"), row.content) << row.last;
+    }
+    CxFile read_only;
+    ASSERT_TRUE(cx_ok(read_only.open(tmp / "out", CX_FILE_READ)));
+    TraceCapture trace(TRC1_ERROR);
+    EXPECT_EQ(dpx_write_xfer_buff(read_only.get(), buffer.data(), 0), DPX_E_FILE_WRITE);
+    EXPECT_EQ(trace.count("Can't write file\n"), 1u) << trace.text();
+}
+
+TEST(FileIdentity, SplitsTheSixtyFourBitLengthIntoChunksAndRemainderAndTakesTheSeconds)
+{
+    TempDir tmp;
+    dpx_file_size size{11, 12};
+    dpx_file_time time{13, 14};
+    EXPECT_EQ(dpx_get_os_file_stats((tmp / "f").c_str(), &size, &time), DPX_E_FILE_READ);
+    EXPECT_TRUE(size.chunks == 11 && size.remainder == 12 && time.low == 13 && time.high == 14) << "written";
+    const struct { uint64_t length; uint32_t chunks, remainder; } rows[] = {
+        {0, 0, 0}, {8192, 2, 0}, {8193, 2, 1}, {1ull << 33, 2097152, 0}, {(1ull << 32) + 5, 1u << 20, 5}};
+    for (const auto &row : rows) {
+        make_file(tmp / "f", row.length, 1234567890, 5);
+        ASSERT_EQ(dpx_get_os_file_stats((tmp / "f").c_str(), &size, &time), DPX_OK);
+        EXPECT_TRUE(size.chunks == row.chunks && size.remainder == row.remainder) << row.length;
+        EXPECT_TRUE(time.low == 1234567890 && time.high == 0) << row.length;
     }
 }
 
-TEST(XferWrite, ARecordLongerThanAChunkIsRefusedBeforeAnythingIsWritten)
+TEST(FileIdentity, ATouchOrAGrowthBetweenCallsIsNoticedButASameSecondRewriteIsNot)
 {
     TempDir tmp;
-    std::vector<dpx_chunk> buffer = {record_of("first"), record_of("second")};
-    buffer[1].length = kChunk + 1;
-    CxFile file;
-    ASSERT_TRUE(cx_ok(file.open(tmp / "out", CX_FILE_WRITE)));
-    EXPECT_EQ(dpx_write_xfer_buff(file.get(), buffer.data(), 1), DPX_E_INVALID_PARAM);
-    EXPECT_EQ(dpx_write_xfer_buff(nullptr, buffer.data(), 0), DPX_E_INVALID_PARAM);
-    ASSERT_TRUE(cx_ok(file.close()));
-    EXPECT_EQ(dpxtest::read_file(tmp / "out"), "");
+    const std::string path = tmp / "f";
+    dpx_file_desc desc{};
+    // The identity goes into the record on the first call, as the read
+    // service does it, and is compared with it on every call. The steps:
+    // unchanged, the same length rewritten within the second, touched, grown
+    // by a byte.
+    const struct { std::string content; time_t seconds; long nanoseconds; dpx_status status; } steps[] = {
+        {"0123456789", 1600000000, 100, DPX_OK}, {"abcdefghij", 1600000000, 999999999, DPX_OK},
+        {"abcdefghij", 1600000001, 0, DPX_E_FILE_CHANGED}, {"abcdefghijk", 1600000000, 0, DPX_E_FILE_CHANGED}};
+    for (const auto &step : steps) {
+        write_file(path, step.content);
+        make_file(path, step.content.size(), step.seconds, step.nanoseconds);
+        dpx_file_size size{};
+        dpx_file_time time{};
+        ASSERT_EQ(dpx_get_os_file_stats(path.c_str(), &size, &time), DPX_OK);
+        ASSERT_EQ(&step == steps ? dpx_init_file_stats(&desc, &size, &time) : DPX_OK, DPX_OK);
+        EXPECT_EQ(dpx_check_file_stats(&desc, &size, &time), step.status) << step.content << " at " << step.seconds;
+    }
 }
 
-TEST(XferWrite, AFailedWriteIsTracedAndReported)
-{
-    TempDir tmp;
-    dpxtest::write_file(tmp / "f", "content");
-    CxFile read_only;
-    ASSERT_TRUE(cx_ok(read_only.open(tmp / "f", CX_FILE_READ)));
-    const std::vector<dpx_chunk> buffer = {record_of(std::string(4096, 'w'))};
-    dpxtest::TraceCapture trace(TRC1_ERROR);
-    EXPECT_EQ(dpx_write_xfer_buff(read_only.get(), buffer.data(), 0), DPX_E_FILE_WRITE);
-    EXPECT_EQ(trace.count("Can't write file"), 1u);
-    EXPECT_EQ(dpxtest::read_file(tmp / "f"), "content");
-}
+}  // namespace
