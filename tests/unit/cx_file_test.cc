@@ -3,6 +3,7 @@
 #include "cx_test_file.h"
 #include "test_support.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <fcntl.h>
@@ -185,6 +186,25 @@ TEST(CxCopy, ReplacesTheDestinationWithTheSourceOrLeavesItWhenTheSourceIsMissing
     EXPECT_EQ(read_file(tmp / "dst"), pattern_bytes(20000, 20000));
     EXPECT_TRUE(cx_is(cx_copy_file((tmp / "missing").c_str(), (tmp / "m/n/dst").c_str()), 'p', ENOENT));
     EXPECT_TRUE(file_exists(tmp / "m/n") && !file_exists(tmp / "m/n/dst"));
+}
+
+TEST(CxTraceLog, IndentsPointsBetweenEnterAndLeaveAndLeavesTheLogAsItWas)
+{
+    const char *log = "/dpx-debug.log";
+    if (access("/", W_OK) != 0)
+        GTEST_SKIP() << "the root directory is not writable here";
+    struct stat before {};
+    bool existed = stat(log, &before) == 0;
+    cxIntlTraceEnter("f %d\n", 1);
+    cxIntlTracePoint("step\n");
+    cxIntlTraceLeave("f\n");
+    std::string text = read_file(log);
+    size_t start = existed ? static_cast<size_t>(before.st_size) : 0;
+    EXPECT_EQ(text.substr(std::min(start, text.size())), "ENTER f 1\n   ... step\nLEAVE f\n");
+    if (existed)
+        EXPECT_EQ(truncate(log, before.st_size), 0);
+    else
+        EXPECT_EQ(unlink(log), 0);
 }
 
 }  // namespace
