@@ -2,298 +2,128 @@
 
 #include "nrtr/nrtr1.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
 #include <cstring>
 
 namespace dpxtest {
 
-uint32_t Rep::drep() const
-{
-    return NCS_DREP(big_endian ? NCS_INT_BIG : NCS_INT_LITTLE, ebcdic ? NCS_CHAR_EBCDIC : NCS_CHAR_ASCII,
-                    float_rep);
-}
+using enum Field;
+const Layout kGetChunksRequest = {{desc, 0},     {crc, 4152},  {state, 4156}, {index, 4160}, {last, 4164},
+                                  {max, 4166},   {size, 4168}, {count, 4170}, {chunks, 4172}};
+const Layout kGetChunksReply = {{desc, 0},      {crc, 4152},  {state, 4156}, {index, 4160}, {last, 4164},
+                                {status, 4168}, {size, 4172}, {count, 4174}, {chunks, 4176}};
+// The gap at 4166 belongs to the first element: with none the body ends there.
+const Layout kPutChunksRequest = {{desc, 0},   {crc, 4152},  {state, 4156}, {last, 4158},
+                                  {max, 4160}, {size, 4162}, {count, 4164}, {chunks, 4168}};
+const Layout kPutChunksReply = {{last, 0}, {status, 4}, {size, 8}, {count, 10}, {chunks, 12}};
+const Layout kAgentQueryRequest = {{query, 0}, {desc, 1024}};
+const Layout kAgentQueryReply = {{result, 0}, {status, 4}};
+const Layout kListNodesRequest = {{filter, 0}, {last, 16}, {max, 18}, {size, 20}, {count, 22}, {nodes, 24}};
+const Layout kListNodesReply = {{last, 0}, {status, 4}, {size, 8}, {count, 10}, {nodes, 12}};
 
-std::string Rep::name() const
+// Two messages are alike when they write alike: every field but the size
+// and count words, nodes apart since their offset depends on the chunks.
+bool operator==(const Message &a, const Message &b)
 {
-    std::string name = std::string(big_endian ? "big" : "little") + (ebcdic ? "_ebcdic" : "_ascii");
-    return float_rep != 0 ? name + "_float" + std::to_string(float_rep) : name;
+    static const Layout kAll = {{desc, 0},      {crc, 4152},    {state, 4156},   {index, 4160},  {last, 4164},
+                                {max, 4166},    {status, 4168}, {result, 4172},  {query, 4176},  {filter, 5200},
+                                {chunks, 5216}};
+    static const Layout kNodes = {{nodes, 0}};
+    return encode(kAll, a, local_rep()) == encode(kAll, b, local_rep()) &&
+           encode(kNodes, a, local_rep()) == encode(kNodes, b, local_rep());
 }
-
-Rep local_rep()
-{
-    Rep rep;
-    rep.big_endian = __BYTE_ORDER__ == __ORDER_BIG_ENDIAN__;
-    return rep;
-}
-
-const Layout kGetChunksRequest = {
-    {Field::desc, 0},     {Field::gap, 4149, 3}, {Field::crc, 4152},  {Field::state, 4156},
-    {Field::gap, 4157, 3}, {Field::index, 4160},  {Field::last, 4164}, {Field::max, 4166},
-    {Field::size, 4168},  {Field::count, 4170},  {Field::chunks, 4172},
-};
-const Layout kGetChunksReply = {
-    {Field::desc, 0},      {Field::gap, 4149, 3},  {Field::crc, 4152},  {Field::state, 4156},
-    {Field::gap, 4157, 3}, {Field::index, 4160},   {Field::last, 4164}, {Field::gap, 4166, 2},
-    {Field::status, 4168}, {Field::size, 4172},    {Field::count, 4174}, {Field::chunks, 4176},
-};
-const Layout kPutChunksRequest = {
-    {Field::desc, 0},     {Field::gap, 4149, 3}, {Field::crc, 4152},  {Field::state, 4156},
-    {Field::gap, 4157, 1}, {Field::last, 4158},   {Field::max, 4160},  {Field::size, 4162},
-    {Field::count, 4164}, {Field::element_gap, 4166, 2}, {Field::chunks, 4168},
-};
-const Layout kPutChunksReply = {
-    {Field::last, 0}, {Field::gap, 2, 2}, {Field::status, 4}, {Field::size, 8}, {Field::count, 10},
-    {Field::chunks, 12},
-};
-const Layout kAgentQueryRequest = {{Field::query, 0}, {Field::desc, 1024}};
-const Layout kAgentQueryReply = {{Field::result, 0}, {Field::status, 4}};
-const Layout kListNodesRequest = {
-    {Field::filter, 0}, {Field::last, 16}, {Field::max, 18}, {Field::size, 20}, {Field::count, 22},
-    {Field::nodes, 24},
-};
-const Layout kListNodesReply = {
-    {Field::last, 0}, {Field::gap, 2, 2}, {Field::status, 4}, {Field::size, 8}, {Field::count, 10},
-    {Field::nodes, 12},
-};
 
 namespace {
 
-constexpr unsigned char kGapFill = 0xA5;
+// Moves the fields of a message to or from the bytes of a body in one
+// representation. The body grows to what is touched, with `gap` in the
+// bytes between fields.
+struct Body {
+    std::vector<unsigned char> &bytes;
+    const Rep rep;
+    const bool write;
+    const unsigned char gap;
 
-uint32_t field_size(const Slot &slot, size_t n)
-{
-    switch (slot.field) {
-    case Field::desc: return 4149;
-    case Field::crc: case Field::index: case Field::status: case Field::result: return 4;
-    case Field::state: return 1;
-    case Field::last: case Field::max: case Field::size: case Field::count: return 2;
-    case Field::query: return DPX_QUERY_LEN;
-    case Field::filter: return DPX_FILTER_LEN;
-    case Field::chunks: return static_cast<uint32_t>(n * sizeof(dpx_chunk));
-    case Field::nodes: return static_cast<uint32_t>(n * DPX_NODE_LEN);
-    case Field::gap: return slot.gap_length;
-    case Field::element_gap: return n > 0 ? slot.gap_length : 0;
-    }
-    return 0;
-}
-
-size_t body_length(const Layout &layout, size_t n)
-{
-    size_t end = 0;
-    for (const Slot &slot : layout) {
-        uint32_t size = field_size(slot, n);
-        if (size > 0)
-            end = std::max<size_t>(end, slot.offset + size);
-    }
-    return end;
-}
-
-// Fields at offsets of one body, in one representation.
-class Body {
-public:
-    Body(std::vector<unsigned char> &bytes, Rep rep) : bytes_(bytes), rep_(rep) {}
-
-    void put16(size_t at, uint16_t value) { put(at, value, 2); }
-    void put32(size_t at, uint32_t value) { put(at, value, 4); }
-    uint16_t get16(size_t at) const { return static_cast<uint16_t>(get(at, 2)); }
-    uint32_t get32(size_t at) const { return static_cast<uint32_t>(get(at, 4)); }
-    void put_chars(size_t at, const char *text, size_t n)
+    void move(const Layout &layout, Message &m)
     {
-        for (size_t i = 0; i < n; ++i) {
-            auto c = static_cast<unsigned char>(text[i]);
-            bytes_[at + i] = rep_.ebcdic ? NRTR1_AsciiToEbcdic()[c] : c;
+        for (const auto &[field, at] : layout) {
+            switch (field) {
+            case desc: file_block(at, m.desc); break;
+            case crc: integer(at, m.crc); break;
+            case state: integer(at, m.state); break;
+            case index: integer(at, m.index); break;
+            case last: integer(at, m.last); break;
+            case max: integer(at, m.max); break;
+            case status: integer(at, m.status); break;
+            case result: integer(at, m.result); break;
+            case query: chars(at, m.query, DPX_QUERY_LEN); break;
+            case filter: chars(at, m.filter, DPX_FILTER_LEN); break;
+            case size: integer(at, m.size_word.emplace(m.size())); break;
+            case count: integer(at, m.count_word.emplace(m.count())); break;
+            case chunks:
+                if (!write)
+                    m.chunks.resize(m.count());
+                for (size_t i = 0; i < m.chunks.size(); ++i) {
+                    integer(at + i * 4104, m.chunks[i].index);
+                    integer(at + i * 4104 + 4, m.chunks[i].length);
+                    copy(at + i * 4104 + 8, m.chunks[i].data, DPX_CHUNK_SIZE);
+                }
+                break;
+            case nodes:
+                if (!write)
+                    m.nodes.resize(m.count());
+                for (size_t i = 0; i < m.nodes.size(); ++i)
+                    chars(at + i * DPX_NODE_LEN, m.nodes[i].data(), DPX_NODE_LEN);
+                break;
+            }
         }
     }
-    void get_chars(size_t at, char *text, size_t n) const
+    // `n` bytes between the body at `at` and `data`, each through `table`
+    // if there is one, in reverse order if `reverse`.
+    void copy(size_t at, void *data, size_t n, const unsigned char *table = nullptr, bool reverse = false)
     {
+        if (bytes.size() < at + n)
+            bytes.resize(at + n, gap);
         for (size_t i = 0; i < n; ++i) {
-            unsigned char c = bytes_[at + i];
-            text[i] = static_cast<char>(rep_.ebcdic ? NRTR1_EbcdicToAscii()[c] : c);
+            unsigned char &wire = bytes[at + (reverse ? n - 1 - i : i)];
+            unsigned char &host = static_cast<unsigned char *>(data)[i];
+            unsigned char &to = write ? wire : host;
+            const unsigned char from = write ? host : wire;
+            to = table != nullptr ? table[from] : from;
         }
     }
-    void put_desc(size_t at, const dpx_file_desc &desc)
+    // In the sender's byte order.
+    void integer(size_t at, auto &v) { copy(at, &v, sizeof v, nullptr, rep.big_endian != local_rep().big_endian); }
+    // In the sender's character set.
+    void chars(size_t at, char *text, size_t n)
     {
-        put_chars(at, desc.node, DPX_NODE_LEN);
-        put_chars(at + 33, desc.path, DPX_PATH_LEN);
-        std::memset(&bytes_[at + 4129], kGapFill, 3);
-        put32(at + 4132, desc.size.chunks);
-        put32(at + 4136, desc.size.remainder);
-        put32(at + 4140, desc.mtime.low);
-        put32(at + 4144, desc.mtime.high);
-        bytes_[at + 4148] = desc.reserved;
+        copy(at, text, n, !rep.ebcdic ? nullptr : write ? NRTR1_AsciiToEbcdic() : NRTR1_EbcdicToAscii());
     }
-    dpx_file_desc get_desc(size_t at, bool zero_gaps) const
+    void file_block(size_t at, dpx_file_desc &d)
     {
-        dpx_file_desc desc{};
-        get_chars(at, desc.node, DPX_NODE_LEN);
-        get_chars(at + 33, desc.path, DPX_PATH_LEN);
-        if (zero_gaps)
-            check_gap(at + 4129, 3);
-        desc.size.chunks = get32(at + 4132);
-        desc.size.remainder = get32(at + 4136);
-        desc.mtime.low = get32(at + 4140);
-        desc.mtime.high = get32(at + 4144);
-        desc.reserved = bytes_[at + 4148];
-        return desc;
+        chars(at, d.node, DPX_NODE_LEN);
+        chars(at + 33, d.path, DPX_PATH_LEN);
+        integer(at + 4132, d.size.chunks);
+        integer(at + 4136, d.size.remainder);
+        integer(at + 4140, d.mtime.low);
+        integer(at + 4144, d.mtime.high);
+        integer(at + 4148, d.reserved);
     }
-    void put_chunk(size_t at, const dpx_chunk &chunk)
-    {
-        put32(at, chunk.index);
-        put32(at + 4, chunk.length);
-        std::memcpy(&bytes_[at + 8], chunk.data, DPX_CHUNK_SIZE);
-    }
-    dpx_chunk get_chunk(size_t at) const
-    {
-        dpx_chunk chunk;
-        chunk.index = get32(at);
-        chunk.length = get32(at + 4);
-        std::memcpy(chunk.data, &bytes_[at + 8], DPX_CHUNK_SIZE);
-        return chunk;
-    }
-    void check_gap(size_t at, size_t n) const
-    {
-        for (size_t i = 0; i < n; ++i)
-            EXPECT_EQ(bytes_[at + i], 0) << "gap byte at offset " << at + i;
-    }
-
-private:
-    void put(size_t at, uint32_t value, size_t n)
-    {
-        for (size_t i = 0; i < n; ++i) {
-            size_t shift = rep_.big_endian ? 8 * (n - 1 - i) : 8 * i;
-            bytes_[at + i] = static_cast<unsigned char>(value >> shift);
-        }
-    }
-    uint32_t get(size_t at, size_t n) const
-    {
-        uint32_t value = 0;
-        for (size_t i = 0; i < n; ++i) {
-            size_t shift = rep_.big_endian ? 8 * (n - 1 - i) : 8 * i;
-            value |= static_cast<uint32_t>(bytes_[at + i]) << shift;
-        }
-        return value;
-    }
-
-    std::vector<unsigned char> &bytes_;
-    Rep rep_;
 };
-
-std::vector<char> fixed_text(const std::string &text, size_t width)
-{
-    std::vector<char> field(width, '\0');
-    std::memcpy(field.data(), text.data(), std::min(text.size(), width));
-    return field;
-}
-
-size_t element_count(const Layout &layout, const Message &message)
-{
-    for (const Slot &slot : layout) {
-        if (slot.field == Field::chunks)
-            return message.chunks.size();
-        if (slot.field == Field::nodes)
-            return message.nodes.size();
-    }
-    return 0;
-}
 
 }  // namespace
 
-std::vector<unsigned char> encode(const Layout &layout, const Message &message, Rep rep)
+std::vector<unsigned char> encode(const Layout &layout, Message message, Rep rep, unsigned char gap)
 {
-    const size_t n = element_count(layout, message);
-    std::vector<unsigned char> bytes(body_length(layout, n), 0);
-    Body body(bytes, rep);
-    for (const Slot &slot : layout) {
-        const size_t at = slot.offset;
-        switch (slot.field) {
-        case Field::desc: body.put_desc(at, message.desc); break;
-        case Field::crc: body.put32(at, message.crc); break;
-        case Field::state: bytes[at] = message.state; break;
-        case Field::index: body.put32(at, message.index); break;
-        case Field::last: body.put16(at, static_cast<uint16_t>(message.last)); break;
-        case Field::max: body.put16(at, static_cast<uint16_t>(message.max)); break;
-        case Field::status: body.put32(at, message.status); break;
-        case Field::result: body.put32(at, message.result); break;
-        case Field::query: body.put_chars(at, fixed_text(message.query, DPX_QUERY_LEN).data(), DPX_QUERY_LEN); break;
-        case Field::filter:
-            body.put_chars(at, fixed_text(message.filter, DPX_FILTER_LEN).data(), DPX_FILTER_LEN);
-            break;
-        case Field::size: body.put16(at, message.size()); break;
-        case Field::count: body.put16(at, message.count()); break;
-        case Field::chunks:
-            for (size_t i = 0; i < n; ++i)
-                body.put_chunk(at + i * sizeof(dpx_chunk), message.chunks[i]);
-            break;
-        case Field::nodes:
-            for (size_t i = 0; i < n; ++i)
-                body.put_chars(at + i * DPX_NODE_LEN, fixed_text(message.nodes[i], DPX_NODE_LEN).data(),
-                               DPX_NODE_LEN);
-            break;
-        case Field::gap:
-        case Field::element_gap: std::memset(&bytes[at], kGapFill, field_size(slot, n)); break;
-        }
-    }
+    std::vector<unsigned char> bytes;
+    Body{bytes, rep, true, gap}.move(layout, message);
     return bytes;
 }
 
-Message decode(const Layout &layout, const std::vector<unsigned char> &bytes, Rep rep, bool zero_gaps)
+Message decode(const Layout &layout, std::vector<unsigned char> body, Rep rep)
 {
     Message message;
-    std::vector<unsigned char> copy = bytes;
-    Body body(copy, rep);
-    size_t n = 0;
-    for (const Slot &slot : layout)
-        if (slot.field == Field::count && slot.offset + 2 <= bytes.size())
-            n = body.get16(slot.offset);
-    if (bytes.size() != body_length(layout, n)) {
-        ADD_FAILURE() << "body of " << bytes.size() << " bytes, expected " << body_length(layout, n);
-        return message;
-    }
-    for (const Slot &slot : layout) {
-        const size_t at = slot.offset;
-        switch (slot.field) {
-        case Field::desc: message.desc = body.get_desc(at, zero_gaps); break;
-        case Field::crc: message.crc = body.get32(at); break;
-        case Field::state: message.state = bytes[at]; break;
-        case Field::index: message.index = body.get32(at); break;
-        case Field::last: message.last = static_cast<int16_t>(body.get16(at)); break;
-        case Field::max: message.max = static_cast<int16_t>(body.get16(at)); break;
-        case Field::status: message.status = body.get32(at); break;
-        case Field::result: message.result = body.get32(at); break;
-        case Field::query: {
-            std::vector<char> text(DPX_QUERY_LEN);
-            body.get_chars(at, text.data(), DPX_QUERY_LEN);
-            message.query = text_of(text.data(), DPX_QUERY_LEN);
-            break;
-        }
-        case Field::filter: {
-            char text[DPX_FILTER_LEN];
-            body.get_chars(at, text, DPX_FILTER_LEN);
-            message.filter = text_of(text, DPX_FILTER_LEN);
-            break;
-        }
-        case Field::size: message.size_word = body.get16(at); break;
-        case Field::count: message.count_word = body.get16(at); break;
-        case Field::chunks:
-            for (size_t i = 0; i < n; ++i)
-                message.chunks.push_back(body.get_chunk(at + i * sizeof(dpx_chunk)));
-            break;
-        case Field::nodes:
-            for (size_t i = 0; i < n; ++i) {
-                char name[DPX_NODE_LEN];
-                body.get_chars(at + i * DPX_NODE_LEN, name, DPX_NODE_LEN);
-                message.nodes.push_back(text_of(name, DPX_NODE_LEN));
-            }
-            break;
-        case Field::gap:
-        case Field::element_gap:
-            if (zero_gaps)
-                body.check_gap(at, field_size(slot, n));
-            break;
-        }
-    }
+    Body{body, rep, false, 0}.move(layout, message);
     return message;
 }
 
@@ -322,23 +152,6 @@ std::vector<dpx_chunk> sample_chunks(size_t n, uint32_t first_index)
             chunks[i].data[j] = static_cast<unsigned char>(j * 13 + i * 31 + 0xC1);
     }
     return chunks;
-}
-
-std::string text_of(const char *field, size_t length)
-{
-    return std::string(field, strnlen(field, length));
-}
-
-bool same_desc(const dpx_file_desc &a, const dpx_file_desc &b)
-{
-    return std::memcmp(a.node, b.node, DPX_NODE_LEN) == 0 && std::memcmp(a.path, b.path, DPX_PATH_LEN) == 0 &&
-           a.size.chunks == b.size.chunks && a.size.remainder == b.size.remainder && a.mtime.low == b.mtime.low &&
-           a.mtime.high == b.mtime.high && a.reserved == b.reserved;
-}
-
-bool same_chunks(const std::vector<dpx_chunk> &a, const dpx_chunk *b, size_t n)
-{
-    return a.size() == n && (n == 0 || std::memcmp(a.data(), b, n * sizeof(dpx_chunk)) == 0);
 }
 
 }  // namespace dpxtest

@@ -7,23 +7,33 @@
 
 #include "dpx/dpx.h"
 
+#include <array>
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace dpxtest {
 
 // The representation of a body's sender.
 struct Rep {
-    bool big_endian = false;
-    bool ebcdic = false;
+    bool big_endian = false, ebcdic = false;
     uint8_t float_rep = 0;
-    uint32_t drep() const;
-    std::string name() const;
+    uint32_t drep() const
+    {
+        return NCS_DREP(big_endian ? NCS_INT_BIG : NCS_INT_LITTLE, ebcdic ? NCS_CHAR_EBCDIC : NCS_CHAR_ASCII,
+                        float_rep);
+    }
 };
 // This machine's.
-Rep local_rep();
+inline Rep local_rep()
+{
+    return Rep{__BYTE_ORDER__ == __ORDER_BIG_ENDIAN__};
+}
+
+// An element of a node list, laid out as a dpx_node_name.
+using Node = std::array<char, DPX_NODE_LEN>;
 
 // Every value that travels in one of the bodies. The size and count words
 // are max + 1 and last + 1 unless set; the array carries `chunks` or `nodes`
@@ -37,46 +47,38 @@ struct Message {
     int16_t max = -1;
     uint32_t status = 0;
     uint32_t result = 0;
-    std::string query;   // up to 1024 characters, NUL-filled on the wire
-    std::string filter;  // up to 16
-    std::optional<uint16_t> size_word;
-    std::optional<uint16_t> count_word;
-    std::vector<dpx_chunk> chunks;
-    std::vector<std::string> nodes;  // up to 33 characters each
+    dpx_query_text query{};
+    dpx_node_filter filter{};
+    std::optional<uint16_t> size_word{};
+    std::optional<uint16_t> count_word{};
+    std::vector<dpx_chunk> chunks{};
+    std::vector<Node> nodes{};
 
     uint16_t size() const { return size_word.value_or(static_cast<uint16_t>(max + 1)); }
     uint16_t count() const { return count_word.value_or(static_cast<uint16_t>(last + 1)); }
 };
+// Every value alike, every byte of texts and arrays included; the size and
+// count words aside.
+bool operator==(const Message &a, const Message &b);
 
-enum class Field { desc, crc, state, index, last, max, status, result, query, filter, size, count, chunks, nodes,
-                   gap, element_gap };
-struct Slot {
-    Field field;
-    uint32_t offset;
-    uint32_t gap_length = 0;  // for gaps; an element gap exists only in front of an element
-};
-using Layout = std::vector<Slot>;
+enum class Field { desc, crc, state, index, last, max, status, result, query, filter, size, count, chunks, nodes };
+// A body's fields in order, each at its offset; the bytes between them are
+// gaps.
+using Layout = std::vector<std::pair<Field, uint32_t>>;
 
-// The eight bodies.
 extern const Layout kGetChunksRequest, kGetChunksReply, kPutChunksRequest, kPutChunksReply, kAgentQueryRequest,
     kAgentQueryReply, kListNodesRequest, kListNodesReply;
 
-// Writes `message` by `layout` in `rep`. Gap bytes are filled with 0xA5,
-// which no reader may look at.
-std::vector<unsigned char> encode(const Layout &layout, const Message &message, Rep rep);
+// Writes `message` by `layout` in `rep`, with `gap` in every gap byte.
+std::vector<unsigned char> encode(const Layout &layout, Message message, Rep rep, unsigned char gap = 0xA5);
 // Reads a body by `layout` in `rep`, taking the array's length from its
-// count word. Fails the running test if the body's length isn't the one the
-// layout gives, or if `zero_gaps` and a gap byte isn't 0.
-Message decode(const Layout &layout, const std::vector<unsigned char> &body, Rep rep, bool zero_gaps = true);
+// count word; bytes that the body lacks read as zero.
+Message decode(const Layout &layout, std::vector<unsigned char> body, Rep rep);
 
-// Test values: a descriptor with texts that use characters from all over
-// the code page, and chunks with distinct indices, lengths and data.
+// Test values: a descriptor whose texts use characters from all over the
+// code page, and chunks with distinct indices, lengths and data.
 dpx_file_desc sample_desc(const std::string &path);
 std::vector<dpx_chunk> sample_chunks(size_t n, uint32_t first_index);
-std::string text_of(const char *field, size_t length);
-// Field by field, gaps aside.
-bool same_desc(const dpx_file_desc &a, const dpx_file_desc &b);
-bool same_chunks(const std::vector<dpx_chunk> &a, const dpx_chunk *b, size_t n);
 
 }  // namespace dpxtest
 
