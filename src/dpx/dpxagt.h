@@ -175,12 +175,18 @@ static_assert(dpx_list_request_bound(-1) >= DPX_LIST_REQUEST_HEAD.end &&
 
 // The most elements a server stub takes in one array. The callers never send
 // more than 128 (transfer buffers hold 24 to 128 records, the Java bridge
-// passes 128 node names); 1024 leaves a margin of eight for peers with larger
-// buffers while a request, whatever its size word claims, can make a server
-// take at most 1024 x 4104 bytes (4 MiB) for its array, where the 16-bit word
-// alone would allow 65,535 x 4104 (256 MiB) before a single element arrived.
-#define DPX_RPC_MAX_ELEMENTS 1024
+// passes 128 node names); 254 leaves a margin of two for peers with larger
+// buffers, and is the most for which the largest reply still fits the
+// carrier's limit on a body (RPC_MAX_BODY), so a server never builds a reply
+// it can't send. A request, whatever its size word claims, thus makes a
+// server take at most 254 x 4104 bytes (1 MiB) for its array, where the
+// 16-bit word alone would allow 65,535 x 4104 (256 MiB) before a single
+// element arrived.
+#define DPX_RPC_MAX_ELEMENTS 254
 
+static_assert(dpx_get_reply_bound(DPX_RPC_MAX_ELEMENTS - 1) <= RPC_MAX_BODY &&
+                  dpx_get_reply_bound(DPX_RPC_MAX_ELEMENTS) > RPC_MAX_BODY,
+              "the largest array is the largest whose reply fits a body of the carrier");
 static_assert(dpx_get_reply_bound(DPX_RPC_MAX_ELEMENTS - 1) < UINT32_MAX / 2, "bounds stay far inside 32 bits");
 
 // ======================================================================
