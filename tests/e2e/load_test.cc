@@ -5,6 +5,7 @@
 #include "fault_kit.h"
 
 #include <cmath>
+#include <filesystem>
 #include <cstdlib>
 #include <random>
 #include <zlib.h>
@@ -110,6 +111,12 @@ TEST(Load, SixtyFourClientsAtOnceMoveEveryFileWholeAndLeaveTheDaemonAsItWas)
     const Plan p = plan();
     ClientOfHub hub;
     pid_t daemon = hub.daemon->process->pid();
+
+    // The runs' top directories exist first: clients racing to make the same
+    // directory may see the other's mkdir win (EEXIST), which the service
+    // reports as a failed open by design.
+    for (const char *run : {"warm", "load"})
+        std::filesystem::create_directories(hub.depot_file(run));
 
     // Warm-up: every server thread has run.
     Outcome warm = run_clients("warm", p.clients, 2, 64u << 10, hub.tmp);
