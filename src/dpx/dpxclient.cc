@@ -69,6 +69,32 @@ void bounded_copy(char *field, const char *text, size_t width)
     std::memset(field + length, 0, width - length);
 }
 
+// The start of both transfer loops: the arguments are there, `*handle` is a
+// duplicate of the hub's binding, and `*desc` names the file with its other
+// fields cleared, since they travel without meaning. Traces with the
+// caller's descriptor; anything but DPX_OK is the loop's result, with no
+// handle to free.
+dpx_status start_transfer(const trc::Scope &scope, bool arguments_given, const char *node, const char *path,
+                          handle_t *handle, dpx_file_desc *desc)
+{
+    if (!arguments_given) {
+        if (scope.on(TRC1_ERROR))
+            TRC1_Printf(scope.desc(), __LINE__, "invalid parameters");
+        return DPX_E_INVALID_PARAM;
+    }
+    dpx_status status = DPX_OK;
+    get_hub_handle(handle, &status);
+    if (status != DPX_OK) {
+        if (scope.on(TRC1_FLOW))
+            TRC1_Printf(scope.desc(), __LINE__, "get_hub_handle call failed rc [0x%x]", status);
+        return status;
+    }
+    std::memset(desc, 0, sizeof *desc);
+    bounded_copy(desc->node, node, sizeof desc->node);
+    bounded_copy(desc->path, path, sizeof desc->path);
+    return DPX_OK;
+}
+
 // Steps 5 to 7 of a download, on the present buffer: one call, the checksum
 // of what arrived against the service's, and the write to the local file.
 void fetch_buffer(handle_t handle, dpx_file_desc *desc, uint32_t *peer_crc, uint32_t *local_crc, uint8_t *state,
@@ -159,23 +185,12 @@ int16_t buffer_request(const dpx_file_size *size)
 dpx_status download_file(const char *node, const char *path, cx_os_file_t *file)
 {
     TRC1_FUNCTION();
-    if (node == nullptr || path == nullptr || file == nullptr) {
-        TRC1_ERROR_MSG("invalid parameters");
-        return DPX_E_INVALID_PARAM;
-    }
-    dpx_status status = DPX_OK;
     handle_t handle = nullptr;
-    get_hub_handle(&handle, &status);
-    if (status != DPX_OK) {
-        TRC1_FLOW_MSG("get_hub_handle call failed rc [0x%x]", status);
-        return status;
-    }
-
-    // Fields that no step sets travel cleared.
     dpx_file_desc desc;
-    std::memset(&desc, 0, sizeof desc);
-    bounded_copy(desc.node, node, sizeof desc.node);
-    bounded_copy(desc.path, path, sizeof desc.path);
+    dpx_status status = start_transfer(trc1_scope_, node != nullptr && path != nullptr && file != nullptr, node,
+                                       path, &handle, &desc);
+    if (status != DPX_OK)
+        return status;
     uint32_t peer_crc = 0;
     uint32_t local_crc = 0;
     uint8_t state = DPX_STATE_FIRST;
@@ -208,22 +223,13 @@ dpx_status download_file(const char *node, const char *path, cx_os_file_t *file)
 dpx_status upload_file(const char *node, const char *path, cx_os_file_t *file, const dpx_file_size *size)
 {
     TRC1_FUNCTION();
-    if (node == nullptr || path == nullptr || file == nullptr || size == nullptr) {
-        TRC1_ERROR_MSG("invalid parameters");
-        return DPX_E_INVALID_PARAM;
-    }
-    dpx_status status = DPX_OK;
     handle_t handle = nullptr;
-    get_hub_handle(&handle, &status);
-    if (status != DPX_OK) {
-        TRC1_FLOW_MSG("get_hub_handle call failed rc [0x%x]", status);
-        return status;
-    }
-
     dpx_file_desc desc;
-    std::memset(&desc, 0, sizeof desc);
-    bounded_copy(desc.node, node, sizeof desc.node);
-    bounded_copy(desc.path, path, sizeof desc.path);
+    dpx_status status = start_transfer(
+        trc1_scope_, node != nullptr && path != nullptr && file != nullptr && size != nullptr, node, path, &handle,
+        &desc);
+    if (status != DPX_OK)
+        return status;
     uint8_t finished = 0;
     uint32_t index = 0;
     int16_t last = -1;
