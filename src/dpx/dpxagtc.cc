@@ -1,4 +1,4 @@
-// Client stubs of dpx_transfer version 1, the interface's specification and
+// Client stubs of dpx_transfer version 1, the interface record (if_spec) and
 // the client entry-point vector.
 #include "dpxagt.h"
 

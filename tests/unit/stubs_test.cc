@@ -256,7 +256,7 @@ std::vector<Case> cases()
 
 // ---- Interface and bodies ---------------------------------------------------
 
-TEST(Interface, TheSpecificationHoldsTheIdentityAndTheLocatorsFindTheVectors)
+TEST(Interface, TheInterfaceRecordHoldsTheIdentityAndTheLocatorsFindTheVectors)
 {
     static_assert(sizeof dpx_transfer_v1_if_spec == 88);
     const rpc__if_spec_t &spec = dpx_transfer_v1_if_spec;

@@ -83,7 +83,7 @@ NCS_API int uuid__equal(const uuid__t *a, const uuid__t *b);
 
 /* ---- Interfaces -------------------------------------------------------- */
 
-/* The interface specification, 88 bytes, integers in the host's byte order. */
+/* The interface record (if_spec), 88 bytes, integers in the host's byte order. */
 typedef struct rpc__if_spec_t {
     uint32_t vers;
     uint16_t port[32];       /* well-known port per socket family; 0: none */
