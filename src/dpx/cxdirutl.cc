@@ -114,7 +114,9 @@ cx_status cx_mkdirs_for_file(const char *path)
     cx_status status = cx_dir_init(&file_dir, path);
     if (cx_succeeded(status))
         status = cx_dir_parent(&file_dir, &parent);
-    if (cx_succeeded(status))
+    // A bare name lies in the working directory and a name right under the
+    // root in the root: both are there, nothing to make.
+    if (cx_succeeded(status) && parent.length > 0)
         status = cx_dir_mkdirs(&parent, kFileDirMode);
     return status;
 }

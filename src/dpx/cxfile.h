@@ -29,7 +29,7 @@ bool cx_succeeded(cx_status status);
 /* Makes every missing directory above the file `path` with mode 0777,
  * whatever the umask. `path` has at most 254 characters (ENAMETOOLONG
  * otherwise). A bare name or a name right under the root has no directory to
- * make and fails with ENOENT. */
+ * make: it succeeds with nothing made. */
 cx_status cx_mkdirs_for_file(const char *path);
 
 /* The real location of `path` into `real` of `real_size` bytes: its longest

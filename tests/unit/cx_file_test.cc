@@ -158,6 +158,13 @@ TEST(CxMove, MakesMissingDirectoriesReplacesTheDestinationAndCrossesFileSystems)
     EXPECT_FALSE(file_exists(tmp / "a") || file_exists(tmp / "c"));
     EXPECT_TRUE(cx_is(cx_move_file((tmp / "gone").c_str(), (tmp / "x/z").c_str()), 'p', ENOENT));
     EXPECT_FALSE(file_exists(tmp / "x/z"));
+    // A bare destination is a name in the working directory.
+    char *cwd = getcwd(nullptr, 0);
+    ASSERT_EQ(chdir(tmp.path().c_str()), 0);
+    EXPECT_TRUE(cx_ok(cx_move_file("x/y/b", "bare")));
+    EXPECT_EQ(chdir(cwd), 0);
+    std::free(cwd);
+    EXPECT_EQ(read_file(tmp / "bare"), "second");
 
     struct stat here {}, shm {};
     if (stat(tmp.path().c_str(), &here) != 0 || stat("/dev/shm", &shm) != 0 || access("/dev/shm", W_OK) != 0 ||
