@@ -16,8 +16,8 @@
 namespace {
 
 const char kUsage[] =
-    "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub] [--broker]\n"
-    "                  [--confine]\n"
+    "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub]\n"
+    "                  [--advertise HOST:PORT] [--broker] [--confine]\n"
     "\n"
     "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
     "\n"
@@ -27,6 +27,9 @@ const char kUsage[] =
     "  --threads N         threads that run calls, 1 to 64 (default 8)\n"
     "  --hub               register this server in the host's location broker as the hub,\n"
     "                      so that clients whose hub is this host find it\n"
+    "  --advertise HOST:PORT  the address registered with --hub, when clients reach this\n"
+    "                      server elsewhere than where it listens (a wildcard --listen,\n"
+    "                      a relay or a forwarded port); default: the address listened on\n"
     "  --broker            run the location broker inside this process, on the broker port\n"
     "  --confine           refuse (0xF11E0001) a path whose real location, symbolic links\n"
     "                      resolved, leaves DIR/NAME; off by default, when links in the\n"
@@ -52,6 +55,8 @@ struct Options {
     std::string product;
     std::string host = "127.0.0.1";
     uint32_t port = 0;
+    std::string advertise_host;  // empty: register the address listened on
+    uint32_t advertise_port = 0;
     uint32_t threads = 8;
     bool hub = false;
     bool broker = false;
@@ -64,7 +69,7 @@ int usage_error(const char *message)
     return 2;
 }
 
-bool parse_listen(const std::string &text, Options &options)
+bool parse_address(const std::string &text, std::string &host_out, uint32_t &port_out)
 {
     size_t colon = text.rfind(':');
     if (colon == std::string::npos)
@@ -76,8 +81,8 @@ bool parse_listen(const std::string &text, Options &options)
     unsigned long port = std::strtoul(text.c_str() + colon + 1, &end, 10);
     if (host.empty() || end == text.c_str() + colon + 1 || *end != '\0' || port > 65535)
         return false;
-    options.host = host;
-    options.port = static_cast<uint32_t>(port);
+    host_out = host;
+    port_out = static_cast<uint32_t>(port);
     return true;
 }
 
@@ -117,8 +122,12 @@ int main(int argc, char **argv)
             options.product = v;
         } else if (arg == "--listen") {
             const char *v = value("--listen");
-            if (v == nullptr || !parse_listen(v, options))
+            if (v == nullptr || !parse_address(v, options.host, options.port))
                 return usage_error("--listen wants HOST:PORT");
+        } else if (arg == "--advertise") {
+            const char *v = value("--advertise");
+            if (v == nullptr || !parse_address(v, options.advertise_host, options.advertise_port))
+                return usage_error("--advertise wants HOST:PORT");
         } else if (arg == "--threads") {
             const char *v = value("--threads");
             char *end = nullptr;
@@ -138,6 +147,8 @@ int main(int argc, char **argv)
     }
     if (options.depot.empty() || options.product.empty())
         return usage_error("--depot and --product are required");
+    if (!options.advertise_host.empty() && !options.hub)
+        return usage_error("--advertise goes with --hub");
 
     // The signals are taken by sigwait below; every thread inherits the mask.
     sigset_t stop_signals;
@@ -153,6 +164,17 @@ int main(int argc, char **argv)
     AFW_SetProductName(options.product.c_str());
 
     uint32_t status = rpc__s_ok;
+    socket__addr_t advertised;
+    uint32_t advertised_len = 0;
+    if (!options.advertise_host.empty()) {
+        advertised_len = sizeof advertised;
+        socket__from_name(0, options.advertise_host.c_str(), static_cast<uint32_t>(options.advertise_host.size()),
+                          options.advertise_port, &advertised, &advertised_len, &status);
+        if (status != rpc__s_ok) {
+            log_line("cannot resolve the --advertise address", status);
+            return 1;
+        }
+    }
     if (options.broker) {
         lb__start_broker(options.host.c_str(), &status);
         if (status != rpc__s_ok) {
@@ -176,8 +198,8 @@ int main(int argc, char **argv)
     if (options.hub) {
         uuid__decode(DPX_HUB_LB_UUID, &entry.obj_interface, &status);
         std::snprintf(entry.annotation, sizeof entry.annotation, "dpx hub %s", options.product.c_str());
-        entry.saddr = bound;
-        entry.saddr_len = bound_len;
+        entry.saddr = advertised_len != 0 ? advertised : bound;
+        entry.saddr_len = advertised_len != 0 ? advertised_len : bound_len;
         lb__register(&entry, &status);
         if (status != rpc__s_ok)
             log_line("cannot register in the location broker", status);
