@@ -202,8 +202,8 @@ TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly
     auto cut_at = std::chrono::steady_clock::now();
     auto [lost, lost_err] = dpx(hosts, dir, {"get", "node1", "cut.bin", dir / "lost.bin"});
     cut.join();
-    // A call's 10 s time-out, the one repeat of an idempotent call, and a
-    // connect time-out bound the wait.
+    // The call's time-out (10 s here) bounds the wait: a time-out is never
+    // repeated. The rest is room for a busy machine.
     EXPECT_LT(std::chrono::steady_clock::now() - cut_at, std::chrono::seconds(40));
     EXPECT_TRUE(exited_with(lost, 1)) << lost_err;
     EXPECT_EQ(lost_err.rfind("0x1C01", 0), 0u) << "not a communication failure: " << lost_err;
