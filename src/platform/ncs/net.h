@@ -9,6 +9,7 @@
 #include <asio.hpp>
 
 #include <cstring>
+#include <limits>
 
 namespace ncs::net {
 
@@ -16,6 +17,15 @@ using asio::ip::tcp;
 
 // Socket buffers of both ends: a whole body of the interface in flight.
 constexpr int kSocketBuffer = 1024 * 1024;
+
+// Completion condition of whole reads and writes. Asio's transfer_all hands
+// at most 64 KiB to each system call, so a body of half a megabyte took nine
+// calls and as many trips through the event loop; this one offers the kernel
+// everything that is left.
+inline size_t whole(const asio::error_code &ec, size_t)
+{
+    return ec ? 0 : std::numeric_limits<size_t>::max();
+}
 
 // The endpoint of an IPv4 or IPv6 address of a handle (checked when the
 // handle was bound).

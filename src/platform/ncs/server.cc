@@ -350,12 +350,12 @@ void Session::on_header(const asio::error_code &ec)
     auto *body = static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS;
     // What has arrived is taken now; the rest is waited for.
     asio::error_code now;
-    const size_t got = asio::read(socket_, asio::buffer(body, request_.body_len), now);
+    const size_t got = asio::read(socket_, asio::buffer(body, request_.body_len), ncs::net::whole, now);
     if (now != asio::error::would_block) {
         on_body(now);
         return;
     }
-    asio::async_read(socket_, asio::buffer(body + got, request_.body_len - got),
+    asio::async_read(socket_, asio::buffer(body + got, request_.body_len - got), ncs::net::whole,
                      [self = shared_from_this()](const asio::error_code &ec, size_t) { self->on_body(ec); });
 }
 
@@ -413,16 +413,17 @@ void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
     touch();
     // What the socket buffer takes goes now; the rest is waited for.
     asio::error_code now;
-    const size_t sent = asio::write(socket_, buffers, now);
+    const size_t sent = asio::write(socket_, buffers, ncs::net::whole, now);
     if (now != asio::error::would_block) {
         on_sent(now, closing);
         return;
     }
     const size_t header_sent = std::min(sent, buffers[0].size());
     const std::array<asio::const_buffer, 2> rest = {buffers[0] + header_sent, buffers[1] + (sent - header_sent)};
-    asio::async_write(socket_, rest, [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
-        self->on_sent(ec, closing);
-    });
+    asio::async_write(socket_, rest, ncs::net::whole,
+                      [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
+                          self->on_sent(ec, closing);
+                      });
 }
 
 void Session::on_sent(const asio::error_code &ec, bool closing)

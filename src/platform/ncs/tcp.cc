@@ -114,12 +114,12 @@ public:
 
     asio::error_code write(const std::array<asio::const_buffer, 2> &buffers, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) { asio::async_write(socket_, buffers, done); });
+        return run(deadline, [&](auto done) { asio::async_write(socket_, buffers, ncs::net::whole, done); });
     }
 
     asio::error_code read(asio::mutable_buffer buffer, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) { asio::async_read(socket_, buffer, done); });
+        return run(deadline, [&](auto done) { asio::async_read(socket_, buffer, ncs::net::whole, done); });
     }
 
 private:
