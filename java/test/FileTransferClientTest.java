@@ -1,50 +1,28 @@
 import com.orvane.quill.flowgauge.core.ft.client.FileTransferClient;
 
-import java.io.BufferedReader;
-import java.io.IOException;
-import java.io.InputStream;
-import java.io.InputStreamReader;
+import java.io.*;
 import java.lang.management.ManagementFactory;
 import java.net.ServerSocket;
-import java.nio.file.Files;
-import java.nio.file.Path;
-import java.util.ArrayList;
-import java.util.Arrays;
-import java.util.Collections;
-import java.util.Comparator;
-import java.util.List;
-import java.util.Map;
-import java.util.Random;
-import java.util.concurrent.BlockingQueue;
-import java.util.concurrent.Callable;
-import java.util.concurrent.ExecutorService;
-import java.util.concurrent.Executors;
-import java.util.concurrent.Future;
-import java.util.concurrent.LinkedBlockingQueue;
-import java.util.concurrent.TimeUnit;
-import java.util.concurrent.atomic.AtomicReference;
+import java.nio.file.*;
+import java.util.*;
+import java.util.concurrent.*;
 import java.util.function.Consumer;
-import java.util.stream.Collectors;
-import java.util.stream.IntStream;
+import java.util.stream.*;
 
 /**
- * FileTransferClient against real hubs in separate processes.
+ * FileTransferClient against real hubs in separate processes. The natives
+ * read their hub, depot root, product and node name from the environment, so
+ * for each scenario this driver starts one JVM, with the scenario's
+ * environment and its own JVM flags (-Xcheck:jni), that starts its hub and
+ * runs the checks. The driver adds up the counts and fails a scenario on any
+ * -Xcheck:jni warning.
  *
- * The natives take their hub, depot root, product and node name from the
- * process environment, so the program runs as a driver: for each scenario it
- * picks a free broker port and starts one JVM with the scenario's environment
- * and its own JVM flags (-Xcheck:jni, java.library.path). That JVM starts its
- * hub, dpx-agentd or dpx_test_peer, on the port and runs the checks. The
- * driver adds up the counts and fails a scenario on any -Xcheck:jni warning.
- *
- * usage: FileTransferClientTest AGENTD TEST_PEER SCENARIO...
- * scenarios: daemon, peer, names, unset
+ * usage: FileTransferClientTest AGENTD TEST_PEER SCENARIO... (daemon, peer, names, unset)
  */
 public class FileTransferClientTest {
     static final int INVALID_PARAM = -249692159;
     static final String ORIGIN = "origin-7";
-    static int passed;
-    static int failed;
+    static int passed, failed;
 
     static void check(boolean ok, String what) {
         if (ok) {
@@ -56,8 +34,7 @@ public class FileTransferClientTest {
     }
 
     static void checkEquals(Object expected, Object actual, String what) {
-        check(expected == null ? actual == null : expected.equals(actual),
-              what + ": expected <" + expected + "> got <" + actual + ">");
+        check(Objects.equals(expected, actual), what + ": expected <" + expected + "> got <" + actual + ">");
     }
 
     public static void main(String[] args) throws Exception {
@@ -74,42 +51,34 @@ public class FileTransferClientTest {
 
     static void drive(String agentd, String peer, String scenario) throws Exception {
         Path work = Files.createTempDirectory("ftc-" + scenario);
-        List<String> command = new ArrayList<>();
-        command.add(Path.of(System.getProperty("java.home"), "bin", "java").toString());
+        List<String> command = new ArrayList<>(List.of(Path.of(System.getProperty("java.home"), "bin", "java") + ""));
         command.addAll(ManagementFactory.getRuntimeMXBean().getInputArguments());
         command.addAll(List.of("-cp", System.getProperty("java.class.path"), "FileTransferClientTest",
                                "--scenario", scenario, agentd, peer, work.toString()));
-        ProcessBuilder builder = new ProcessBuilder(command);
+        // -Xcheck:jni warns on standard output, the JVM's own messages go to standard error: both are read.
+        ProcessBuilder builder = new ProcessBuilder(command).redirectErrorStream(true);
         Map<String, String> env = builder.environment();
-        env.keySet().removeAll(List.of("DPX_DEPOTROOT", "VESPERHOME", "AFW_PRODUCT", "AFW_ORIGIN_NODE",
-                                       "AFW_HUB_HOST", "DPX_HUBHOST", "NCS_LB_PORT"));
-        env.put("DPX_HUBHOST", "127.0.0.1");
-        env.put("NCS_LB_PORT", Integer.toString(freePort()));
-        env.put("AFW_ORIGIN_NODE", ORIGIN);
-        if (scenario.equals("daemon")) {
-            env.put("DPX_DEPOTROOT", work.resolve("depot").toString());
-            env.put("AFW_PRODUCT", "prod");
-        }
+        env.keySet().removeAll(List.of("DPX_DEPOTROOT", "VESPERHOME", "AFW_PRODUCT", "AFW_HUB_HOST"));
+        env.putAll(Map.of("DPX_HUBHOST", "127.0.0.1", "NCS_LB_PORT", Integer.toString(freePort()),
+                          "AFW_ORIGIN_NODE", ORIGIN));
+        if (scenario.equals("daemon"))
+            env.putAll(Map.of("DPX_DEPOTROOT", work.resolve("depot").toString(), "AFW_PRODUCT", "prod"));
         Process child = builder.start();
-        List<String> warnings = Collections.synchronizedList(new ArrayList<>());
-        AtomicReference<String> counts = new AtomicReference<>();
-        Thread out = watch(child.getInputStream(), "[" + scenario + "] ", warnings, counts);
-        Thread err = watch(child.getErrorStream(), "[" + scenario + " stderr] ", warnings, counts);
-        boolean ended = child.waitFor(540, TimeUnit.SECONDS);
-        if (!ended) {
-            child.destroy();  // its shutdown hook stops its hub
-            if (!child.waitFor(10, TimeUnit.SECONDS))
-                child.destroyForcibly();
+        List<String> warnings = new ArrayList<>();
+        List<String> counts = new ArrayList<>();
+        forEachLine(child.getInputStream(), line -> {
+            System.out.println("[" + scenario + "] " + line);
+            if (line.contains("WARNING"))
+                warnings.add(line);
+            if (line.matches("\\d+ passed, \\d+ failed"))
+                counts.add(line);
+        });
+        check(child.waitFor() == 0, scenario + ": the JVM runs its checks and exits with 0");
+        check(counts.size() == 1, scenario + ": the JVM reports its counts");
+        for (String line : counts) {
+            passed += Integer.parseInt(line.split(" ")[0]);
+            failed += Integer.parseInt(line.split(" ")[2]);
         }
-        out.join();
-        err.join();
-        check(ended && child.exitValue() == 0, scenario + ": the JVM runs its checks and exits with 0");
-        if (counts.get() != null) {
-            String[] words = counts.get().split(" ");
-            passed += Integer.parseInt(words[0]);
-            failed += Integer.parseInt(words[2]);
-        }
-        check(counts.get() != null, scenario + ": the JVM reports its counts");
         check(warnings.isEmpty(), scenario + ": no -Xcheck:jni warnings, saw " + warnings);
         deleteTree(work);
     }
@@ -118,23 +87,6 @@ public class FileTransferClientTest {
         try (ServerSocket socket = new ServerSocket(0)) {
             return socket.getLocalPort();
         }
-    }
-
-    /**
-     * Echoes the lines of a child with a prefix, collecting warnings and its
-     * closing counts. -Xcheck:jni writes its warnings to standard output, the
-     * JVM's own messages go to standard error: both streams are watched.
-     */
-    static Thread watch(InputStream stream, String prefix, List<String> warnings, AtomicReference<String> counts) {
-        Thread thread = new Thread(() -> forEachLine(stream, line -> {
-            System.out.println(prefix + line);
-            if (line.contains("WARNING"))
-                warnings.add(line);
-            if (line.matches("\\d+ passed, \\d+ failed"))
-                counts.set(line);
-        }));
-        thread.start();
-        return thread;
     }
 
     /** Hands each line to sink until the stream ends or is closed. */
@@ -149,7 +101,7 @@ public class FileTransferClientTest {
 
     static void deleteTree(Path root) throws IOException {
         try (var paths = Files.walk(root)) {
-            for (Path p : paths.sorted(Comparator.reverseOrder()).collect(Collectors.toList()))
+            for (Path p : paths.sorted(Comparator.reverseOrder()).toList())
                 Files.delete(p);
         }
     }
@@ -158,28 +110,22 @@ public class FileTransferClientTest {
 
     /** A hub program on the broker port of this JVM's environment; stopped when the JVM ends. */
     static final class Hub {
-        final Process process;
         final BlockingQueue<String> lines = new LinkedBlockingQueue<>();
 
         Hub(Path work, String... command) throws Exception {
-            process = new ProcessBuilder(command)
-                .redirectError(work.resolve("hub.err").toFile())
-                .start();
+            Process process = new ProcessBuilder(command).redirectError(work.resolve("hub.err").toFile()).start();
             Runtime.getRuntime().addShutdownHook(new Thread(() -> {
                 process.destroy();
-                try {
-                    process.waitFor(10, TimeUnit.SECONDS);
-                } catch (InterruptedException e) {
-                    Thread.currentThread().interrupt();
-                }
+                process.onExit().completeOnTimeout(process, 10, TimeUnit.SECONDS).join();
             }));
+            // Drained all along: the test peer prints a line per call.
             Thread reader = new Thread(() -> forEachLine(process.getInputStream(), lines::add));
             reader.setDaemon(true);
             reader.start();
             String first = next();
             if (first == null || !first.startsWith("listening on "))
-                throw new IllegalStateException(command[0] + " did not start: " + first
-                                                + " " + Files.readString(work.resolve("hub.err")));
+                throw new IllegalStateException(command[0] + " did not start: "
+                                                + Files.readString(work.resolve("hub.err")));
         }
 
         /** The next line the hub printed, or null after 30 seconds without one. */
@@ -193,26 +139,23 @@ public class FileTransferClientTest {
     static void runScenario(String scenario, String agentd, String peer, Path work) throws Exception {
         FileTransferClient client = new FileTransferClient();
         switch (scenario) {
-            case "daemon":
+            case "daemon" -> {
                 new Hub(work, agentd, "--depot", work.resolve("depot").toString(), "--product", "prod",
                         "--broker", "--hub");
                 daemon(client, work, work.resolve("depot").resolve("prod"));
-                break;
-            case "peer":
-                Hub hub = new Hub(work, peer, "--broker", "--hub", "--nodes", "a,b,c", "--query-result", "7");
-                peer(client, hub, work);
-                break;
-            case "names":
+            }
+            case "peer" ->
+                peer(client, new Hub(work, peer, "--broker", "--hub", "--nodes", "a,b,c", "--query-result", "7"), work);
+            case "names" -> {
                 new Hub(work, peer, "--broker", "--hub", "--nodes", String.join(",", manyNames()));
                 names(client);
-                break;
-            case "unset":
+            }
+            case "unset" -> {
                 checkEquals(null, client.getRootDepot(), "getRootDepot without DPX_DEPOTROOT or VESPERHOME");
                 checkEquals(null, client.getAgentID(), "getAgentID without AFW_PRODUCT");
                 checkEquals(ORIGIN, client.getOriginNode(), "getOriginNode");
-                break;
-            default:
-                throw new IllegalArgumentException(scenario);
+            }
+            default -> throw new IllegalArgumentException(scenario);
         }
     }
 
@@ -254,30 +197,24 @@ public class FileTransferClientTest {
         checkEquals(0, client.listNodes("").length, "listNodes against the library's own service");
 
         // Sixteen threads at once, each with its own file up and back down.
-        int threads = 16;
-        ExecutorService pool = Executors.newFixedThreadPool(threads);
-        List<Callable<String>> jobs = new ArrayList<>();
-        for (int i = 0; i < threads; i++) {
-            int n = i;
-            jobs.add(() -> {
+        List<String> problems = Collections.synchronizedList(new ArrayList<>());
+        List<Thread> threads = IntStream.range(0, 16).mapToObj(n -> new Thread(() -> {
+            try {
                 byte[] data = pattern(40_000 + n * 7_919, 100 + n);
-                Path up = work.resolve("mt-up-" + n);
-                Path down = work.resolve("mt/down-" + n);
+                Path up = work.resolve("mt-up-" + n), down = work.resolve("mt/down-" + n);
                 Files.write(up, data);
                 int put = client.putFile("n1", "mt/" + n + ".bin", up.toString());
                 int get = client.getFile("n1", "mt/" + n + ".bin", down.toString());
-                if (put != 0 || get != 0)
-                    return "thread " + n + ": put " + put + " get " + get;
-                if (!sameBytes(served.resolve("mt/" + n + ".bin"), data) || !sameBytes(down, data))
-                    return "thread " + n + ": content differs";
-                return null;
-            });
-        }
-        List<String> problems = new ArrayList<>();
-        for (Future<String> f : pool.invokeAll(jobs))
-            if (f.get() != null)
-                problems.add(f.get());
-        pool.shutdown();
+                if (put != 0 || get != 0 || !sameBytes(served.resolve("mt/" + n + ".bin"), data)
+                    || !sameBytes(down, data))
+                    problems.add("thread " + n + ": put " + put + ", get " + get);
+            } catch (IOException e) {
+                problems.add(e.toString());
+            }
+        })).toList();
+        threads.forEach(Thread::start);
+        for (Thread thread : threads)
+            thread.join();
         check(problems.isEmpty(), "16 threads transfer at once: " + problems);
     }
 
@@ -308,9 +245,7 @@ public class FileTransferClientTest {
     }
 
     static List<String> manyNames() {
-        List<String> names = IntStream.range(0, 127).mapToObj(i -> "node" + i).collect(Collectors.toList());
-        names.add("x".repeat(40));
-        return names;
+        return IntStream.range(0, 128).mapToObj(i -> i < 127 ? "node" + i : "x".repeat(40)).toList();
     }
 
     static void names(FileTransferClient client) {

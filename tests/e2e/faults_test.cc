@@ -1,14 +1,15 @@
-// Faults around whole transfers, with the hub daemon as a process of its own:
-// the daemon killed at random points, connections cut mid-body, a daemon that
-// stops answering, the broker down, the depot's disk full, the source file
-// changed during a download, a target that can't be written. After each: the
-// status of the failure, no temporary file, the target of a failed get as it
-// was, an upload's target a prefix of its source, no descriptor left behind
-// in either process, and the daemon serving the next request.
-#include "fault_kit.h"
+// Faults around whole transfers: the daemon killed at random points,
+// connections cut mid-body, a daemon that stops answering, the broker down,
+// the depot's disk full, the source changed during a download, a target that
+// can't be written. After each: the status, no temporary file, the target of
+// a failed get as it was, an upload's target a prefix of its source, no
+// descriptor left behind in either process, and the daemon serving again.
+#include "hub.h"
+
+#include "ncs/lb.h"
 
 #include <cerrno>
-#include <cstdlib>
+#include <cstring>
 #include <future>
 #include <random>
 #include <sys/mount.h>
@@ -16,11 +17,6 @@
 namespace {
 
 using namespace dpxtest;
-
-bool slow_skipped()
-{
-    return std::getenv("DPX_SKIP_SLOW") != nullptr;
-}
 
 // A file large enough that a fault lands inside its transfer.
 size_t big_size()
@@ -34,14 +30,11 @@ bool comm_failure(dpx_status status)
 }
 
 struct Tally {
-    int faults = 0;
-    int verified = 0;
+    int faults = 0, verified = 0, lost = 0;
     uint64_t bytes = 0;
-    int lost = 0;
 } g_tally;
 
-class Summary : public testing::Environment {
-public:
+struct Summary : testing::Environment {
     void TearDown() override
     {
         std::printf("faults tried %d, transfers verified %d, bytes moved %llu, %s\n", g_tally.faults,
@@ -51,119 +44,79 @@ public:
 };
 testing::Environment *const g_summary = testing::AddGlobalTestEnvironment(new Summary);
 
-bool is_prefix(const std::string &part, const std::string &whole)
-{
-    return part.size() <= whole.size() && whole.compare(0, part.size(), part) == 0;
-}
-
-// A hub with a broker of its own, so that the daemon can die and come back
-// under a new port while clients still find it.
 struct Rig {
-    Broker broker;
-    ClientOfHub hub{{}, "dpx-agentd", broker.port};
-    Resources client_before;
-    Resources daemon_before;
+    Hub hub;
+    Resources client_before, daemon_before;
     std::mt19937 random{20240611};
 
     Rig()
     {
-        std::filesystem::create_directories(hub.depot + "/prod");
         // A first round trip: the binding is cached and the connection pooled.
         verify_round_trip();
-        client_before = resources_of("self");
-        daemon_before = resources_of(hub.daemon->process->pid());
+        client_before = resources_of(0);
+        daemon_before = resources_of(hub.daemon->pid());
     }
-    ~Rig() { EXPECT_TRUE(exited_with(hub.daemon->stop(), 0)) << "the daemon did not end cleanly"; }
-
-    std::string local(const std::string &name) const { return hub.dir / name; }
+    ~Rig() { EXPECT_TRUE(exited_with(hub.stop(), 0)) << "the daemon did not end cleanly"; }
 
     void restart_daemon()
     {
-        hub.daemon->process->signal(SIGKILL);
-        hub.daemon->process->wait();
-        hub.daemon = std::make_unique<Daemon>(hub.depot, "prod", std::vector<std::string>{}, "dpx-agentd", broker.port);
+        hub.daemon->signal(SIGKILL);
+        hub.daemon->wait();
+        hub.start();
         daemon_before = Resources{};
     }
 
-    // A put and a get of a fresh file, compared byte for byte.
     void verify_round_trip()
     {
         static int n = 0;
-        std::string name = "verify/" + std::to_string(++n) + ".bin";
+        std::string name = "verify/" + std::to_string(++n);
         std::string content = pattern_bytes(200000 + static_cast<size_t>(n), static_cast<uint32_t>(n));
-        write_file(local("verify.src"), content);
-        ASSERT_EQ(PutFile("node1", name.c_str(), local("verify.src").c_str()), DPX_OK);
-        ASSERT_EQ(GetFile("node1", name.c_str(), local("verify.dst").c_str()), DPX_OK);
-        EXPECT_EQ(read_file(local("verify.dst")), content);
-        EXPECT_EQ(read_file(hub.depot_file(name)), content);
-        g_tally.verified += 2;
-        g_tally.bytes += 2 * content.size();
+        EXPECT_EQ(checked(true, name, {content}), DPX_OK);
+        EXPECT_EQ(checked(false, name, {content}), DPX_OK);
     }
 
-    // After a fault: no temporary file, the daemon serves again, and neither
-    // process holds more than before. The client may keep one pooled
-    // connection to each daemon it has known.
+    // The client may keep a pooled connection to each daemon it has known.
     void check_after_fault(int daemons_known = 1)
     {
         ++g_tally.faults;
         EXPECT_TRUE(hub.temp_files().empty()) << "a temporary file was left";
         verify_round_trip();
-        Resources client = resources_of("self");
+        Resources client = resources_of(0);
         EXPECT_EQ(client.files, client_before.files) << "descriptors leaked in the client";
         EXPECT_LE(client.sockets, client_before.sockets + static_cast<size_t>(daemons_known));
         if (daemon_before.files == 0)
             return;  // a daemon started since: nothing to compare with
-        pid_t pid = hub.daemon->process->pid();
+        Resources daemon;
         EXPECT_TRUE(eventually([&] {
-            Resources daemon = resources_of(pid);
+            daemon = resources_of(hub.daemon->pid());
             return daemon.files == daemon_before.files && daemon.sockets <= daemon_before.sockets;
-        })) << "descriptors leaked in the daemon: " << resources_of(pid).files << " files and "
-            << resources_of(pid).sockets << " sockets, " << daemon_before.files << " and " << daemon_before.sockets
-            << " before";
+        })) << "the daemon holds " << daemon.files << " files and " << daemon.sockets << " sockets, "
+            << daemon_before.files << " and " << daemon_before.sockets << " before";
     }
 
-    // The get of `name` into a target that holds other content: a success
-    // delivers one of `accepted` whole, a failure leaves the old content.
-    dpx_status checked_get(const std::string &name, const std::vector<std::string> &accepted,
-                           const std::function<void()> &fault)
+    // A transfer with `fault` while it runs. A get goes into a target that
+    // holds other content: a success delivers one of `versions` whole, a
+    // failure leaves the old content. A put sends versions[0] to a new `name`:
+    // the depot's file is all of it after a success, a prefix after a failure.
+    dpx_status checked(bool put, const std::string &name, const std::vector<std::string> &versions,
+                       const std::function<void()> &fault = [] {})
     {
-        std::string target = local("target.bin");
-        write_file(target, "old content");
-        auto get = std::async(std::launch::async, [&] { return GetFile("node1", name.c_str(), target.c_str()); });
+        std::string local = hub / (put ? "source.bin" : "target.bin"), stored = hub.depot_file(name);
+        write_file(local, put ? versions[0] : "old content");
+        auto call = std::async(std::launch::async, [&] {
+            return put ? PutFile("node1", name.c_str(), local.c_str()) : GetFile("node1", name.c_str(), local.c_str());
+        });
         fault();
-        EXPECT_EQ(get.wait_for(std::chrono::seconds(120)), std::future_status::ready) << "the get did not end";
-        dpx_status status = get.get();
-        std::string got = read_file(target);
-        bool whole = std::find(accepted.begin(), accepted.end(), got) != accepted.end();
-        if (status == DPX_OK) {
-            EXPECT_TRUE(whole) << "a successful get delivered " << got.size() << " bytes of no version";
-            g_tally.verified += whole ? 1 : 0;
-            g_tally.bytes += got.size();
-            g_tally.lost += whole ? 0 : 1;
-        } else {
-            EXPECT_EQ(got, "old content") << "a failed get changed its target";
-        }
-        return status;
-    }
-
-    // The put of `content` to a new `name`: the depot's file is a prefix of
-    // it after a failure and all of it after a success.
-    dpx_status checked_put(const std::string &name, const std::string &content, const std::function<void()> &fault)
-    {
-        write_file(local("source.bin"), content);
-        auto put = std::async(std::launch::async,
-                              [&] { return PutFile("node1", name.c_str(), local("source.bin").c_str()); });
-        fault();
-        EXPECT_EQ(put.wait_for(std::chrono::seconds(120)), std::future_status::ready) << "the put did not end";
-        dpx_status status = put.get();
-        std::string stored = file_exists(hub.depot_file(name)) ? read_file(hub.depot_file(name)) : "";
-        bool sound = status == DPX_OK ? stored == content : is_prefix(stored, content);
-        EXPECT_TRUE(sound) << "the depot holds " << stored.size() << " bytes that aren't what was sent";
-        g_tally.lost += sound ? 0 : 1;
-        if (status == DPX_OK && sound) {
-            ++g_tally.verified;
-            g_tally.bytes += content.size();
-        }
+        EXPECT_EQ(call.wait_for(std::chrono::seconds(120)), std::future_status::ready) << "the transfer did not end";
+        dpx_status status = call.get();
+        std::string got = !put ? read_file(local) : file_exists(stored) ? read_file(stored) : "";
+        bool sound = status == DPX_OK ? std::find(versions.begin(), versions.end(), got) != versions.end()
+                     : put            ? versions[0].compare(0, got.size(), got) == 0
+                                      : got == "old content";
+        EXPECT_TRUE(sound) << "status " << status << " with " << got.size() << " bytes of no version";
+        g_tally.lost += !sound;
+        g_tally.verified += status == DPX_OK && sound;
+        g_tally.bytes += status == DPX_OK && sound ? got.size() : 0;
         return status;
     }
 
@@ -182,32 +135,49 @@ TEST(Faults, ADaemonKilledAtRandomPointsOfTransfersFailsThemCleanlyAndServesAgai
         SCOPED_TRACE(round);
         auto kill = [&] {
             rig.sleep_random_ms(300);
-            rig.hub.daemon->process->signal(SIGKILL);
+            rig.hub.daemon->signal(SIGKILL);
         };
-        dpx_status status = round % 2 == 0
-                                ? rig.checked_get("big.bin", {content}, kill)
-                                : rig.checked_put("up/" + std::to_string(round) + ".bin", content, kill);
+        dpx_status status = rig.checked(round % 2 == 1, round % 2 ? "up/" + std::to_string(round) : "big.bin",
+                                        {content}, kill);
         EXPECT_TRUE(status == DPX_OK || comm_failure(status)) << std::hex << status;
         rig.restart_daemon();
-        if (status == DPX_OK) {
-            // The transfer ended before the kill: the cached binding still
-            // names the dead daemon, as the next call would learn.
+        // A transfer that ended before the kill leaves a binding to the dead
+        // daemon, as the next call would learn.
+        if (status == DPX_OK)
             invalidate_hub_handle();
-        }
         rig.check_after_fault(round + 2);
     }
 }
+
+// Stands in the broker as the hub at `port` of 127.0.0.1, ahead of the daemon.
+struct HubEntry {
+    explicit HubEntry(uint16_t port)
+    {
+        uint32_t status = 0;
+        uuid__decode(DPX_HUB_LB_UUID, &entry.obj_interface, &status);
+        entry.saddr_len = sizeof entry.saddr;
+        socket__from_name(AF_INET, "127.0.0.1", 9, port, &entry.saddr, &entry.saddr_len, &status);
+        lb__register(&entry, &status);
+        EXPECT_EQ(status, rpc__s_ok);
+    }
+    ~HubEntry()
+    {
+        uint32_t status = 0;
+        lb__unregister(&entry, &status);
+    }
+    lb__entry_t entry{};
+};
 
 TEST(Faults, AConnectionCutMidBodyFailsTheTransferOrIsRepeatedWhole)
 {
     Rig rig;
     std::string content = pattern_bytes(big_size() / 4, 12);
     write_file(rig.hub.depot_file("cut.bin"), content);
-    int round = 0;  // proxies so far
-    // One connection cut: a get is idempotent and repeated on a new
-    // connection, an upload's frame that didn't leave whole is too, so either
-    // may still succeed. Every connection cut before a buffer of 128 records
-    // has passed: the one repeat is cut too, and the transfer fails.
+    int round = 0;
+    // One cut: a get is idempotent and repeated on a new connection, and so is
+    // an upload's frame that didn't leave whole, so either may succeed. Every
+    // connection cut before a buffer of 128 records has passed: the one repeat
+    // is cut too, and the transfer fails.
     for (int cuts : {1, 1000}) {
         for (bool upload : {false, true}) {
             SCOPED_TRACE(std::to_string(cuts) + (upload ? " cuts of an upload" : " cuts of a download"));
@@ -215,22 +185,19 @@ TEST(Faults, AConnectionCutMidBodyFailsTheTransferOrIsRepeatedWhole)
             uint64_t limit = std::uniform_int_distribution<uint64_t>(100, most)(rig.random);
             dpx_status status;
             {
-                CuttingProxy proxy(rig.hub.daemon->port, upload, limit, cuts);
-                HubEntry entry(proxy.port);
+                // A relay without delay that cuts the first `cuts` connections.
+                Process proxy({bin_dir() + "/dpx_test_delay", "127.0.0.1", "0", "127.0.0.1",
+                               std::to_string(rig.hub.port), "0", upload ? "up" : "down", std::to_string(limit),
+                               std::to_string(cuts)});
+                HubEntry entry(listening_port(proxy, "relaying on "));
                 invalidate_hub_handle();  // the next call looks up the proxy
-                auto nothing = [] {};
                 ++round;
-                status = upload ? rig.checked_put("cut/" + std::to_string(round) + ".bin", content, nothing)
-                                : rig.checked_get("cut.bin", {content}, nothing);
-                EXPECT_GE(proxy.cut.load(), 1);
+                status = rig.checked(upload, upload ? "cut/" + std::to_string(round) : "cut.bin", {content});
+                EXPECT_TRUE(proxy.wait_line("cut").has_value());
             }
             invalidate_hub_handle();
             EXPECT_TRUE(status == DPX_OK || comm_failure(status)) << std::hex << status;
-            if (cuts > 1) {
-                EXPECT_NE(status, DPX_OK) << "a transfer cut on every connection succeeded";
-            }
-            // The client keeps a pooled connection to each proxy it knew,
-            // and one to the broker it registered with.
+            EXPECT_TRUE(cuts == 1 || status != DPX_OK) << "a transfer cut on every connection succeeded";
             rig.check_after_fault(round + 1);
         }
     }
@@ -244,12 +211,9 @@ TEST(Faults, ADaemonThatStopsAnsweringFailsTheCallAtItsTimeOut)
     write_file(rig.hub.depot_file("stopped.bin"), content);
     for (bool upload : {false, true}) {
         SCOPED_TRACE(upload ? "upload" : "download");
-        pid_t pid = rig.hub.daemon->process->pid();
-        kill(pid, SIGSTOP);
-        auto nothing = [] {};
-        dpx_status status = upload ? rig.checked_put("stopped/up.bin", content, nothing)
-                                   : rig.checked_get("stopped.bin", {content}, nothing);
-        kill(pid, SIGCONT);
+        rig.hub.daemon->signal(SIGSTOP);
+        dpx_status status = rig.checked(upload, upload ? "stopped/up.bin" : "stopped.bin", {content});
+        rig.hub.daemon->signal(SIGCONT);
         EXPECT_EQ(status, rpc__s_timeout) << std::hex << status;
         rig.check_after_fault();
     }
@@ -258,98 +222,59 @@ TEST(Faults, ADaemonThatStopsAnsweringFailsTheCallAtItsTimeOut)
 TEST(Faults, WithTheBrokerDownACachedBindingStillServesAndANewOneFailsUntilItIsBack)
 {
     Rig rig;
-    uint16_t port = rig.broker.port;
-    rig.broker.process->signal(SIGKILL);
-    rig.broker.process->wait();
+    rig.hub.broker.reset();
     rig.verify_round_trip();
 
-    // A failed lookup leaves the cleared binding in place: the first call
-    // on it fails.
+    // A failed lookup leaves the cleared binding in place: the first call on it fails.
     invalidate_hub_handle();
     std::string content = pattern_bytes(50000, 14);
     write_file(rig.hub.depot_file("b.bin"), content);
-    EXPECT_EQ(rig.checked_get("b.bin", {content}, [] {}), rpc__s_not_bound);
+    EXPECT_EQ(rig.checked(false, "b.bin", {content}), rpc__s_not_bound);
 
-    // A broker back on its port knows nothing: the daemon registers anew when
-    // it starts again.
-    rig.broker.process = std::make_unique<Process>(std::vector<std::string>{bin_dir() + "/dpx-lbd"},
-                                                   std::map<std::string, std::optional<std::string>>{
-                                                       {"NCS_LB_PORT", std::to_string(port)}});
-    ASSERT_TRUE(rig.broker.process->wait_line("listening on ").has_value());
+    // A broker back on its port knows nothing: the daemon registers anew when it starts again.
+    rig.hub.broker = std::make_unique<Process>(std::vector<std::string>{bin_dir() + "/dpx-lbd"});
+    ASSERT_NE(listening_port(*rig.hub.broker), 0);
     rig.restart_daemon();
     rig.check_after_fault(2);
 }
 
-// A tmpfs of 1 MiB over the product's directory, unmounted at the end.
-class SmallDisk {
-public:
-    explicit SmallDisk(const std::string &dir) : dir_(dir)
-    {
-        std::filesystem::create_directories(dir);
-        mounted_ = mount("dpxtest", dir.c_str(), "tmpfs", 0, "size=1m") == 0;
-        error_ = errno;
-    }
-    ~SmallDisk()
-    {
-        if (mounted_)
-            umount2(dir_.c_str(), MNT_DETACH);
-    }
-    bool mounted() const { return mounted_; }
-    std::string error() const { return std::strerror(error_); }
-
-private:
-    std::string dir_;
-    bool mounted_ = false;
-    int error_ = 0;
-};
-
 TEST(Faults, AnUploadToAFullDiskFailsWithAWriteErrorAndKeepsWhatFitted)
 {
     Rig rig;
-    SmallDisk disk(rig.hub.depot + "/prod/full");
-    if (!disk.mounted())
-        GTEST_SKIP() << "cannot mount a small tmpfs here (" << disk.error() << "): needs CAP_SYS_ADMIN";
-    std::string content = pattern_bytes(3 << 20, 15);
-    EXPECT_EQ(rig.checked_put("full/big.bin", content, [] {}), DPX_E_FILE_WRITE);
+    std::string disk = made_dir(rig.hub.depot_file("full"));
+    if (mount("dpxtest", disk.c_str(), "tmpfs", 0, "size=1m") != 0)
+        GTEST_SKIP() << "cannot mount a small tmpfs here (" << std::strerror(errno) << "): needs CAP_SYS_ADMIN";
+    struct Unmount {
+        std::string dir;
+        ~Unmount() { umount2(dir.c_str(), MNT_DETACH); }
+    } unmount{disk};
+    EXPECT_EQ(rig.checked(true, "full/big.bin", {pattern_bytes(3 << 20, 15)}), DPX_E_FILE_WRITE);
     std::filesystem::remove(rig.hub.depot_file("full/big.bin"));
-    std::string small = pattern_bytes(100000, 16);
-    EXPECT_EQ(rig.checked_put("full/small.bin", small, [] {}), DPX_OK);
+    EXPECT_EQ(rig.checked(true, "full/small.bin", {pattern_bytes(100000, 16)}), DPX_OK);
     rig.check_after_fault();
 }
 
 TEST(Faults, ASourceChangedDuringADownloadFailsItOrArrivesAsOneWholeVersion)
 {
     Rig rig;
-    std::string path = rig.hub.depot_file("changing.bin");
-    std::string old_content = pattern_bytes(big_size() / 2, 17);
-    struct Change {
-        const char *what;
-        std::function<std::string(const std::string &)> apply;  // returns the new content
-    };
-    const Change changes[] = {
-        {"grown", [](const std::string &p) {
-             std::ofstream(p, std::ios::binary | std::ios::app) << "tail";
-             return read_file(p);
-         }},
-        {"truncated", [](const std::string &p) {
-             std::filesystem::resize_file(p, 1000);
-             return read_file(p);
-         }},
-        {"replaced", [](const std::string &p) {
-             std::string other = pattern_bytes(300000, 18);
-             write_file(p + ".new", other);
-             std::filesystem::rename(p + ".new", p);
-             return other;
+    std::string path = rig.hub.depot_file("changing.bin"), old_content = pattern_bytes(big_size() / 2, 17);
+    const std::pair<const char *, std::function<void()>> changes[] = {
+        {"grown", [&] { std::ofstream(path, std::ios::binary | std::ios::app) << "tail"; }},
+        {"truncated", [&] { std::filesystem::resize_file(path, 1000); }},
+        {"replaced", [&] {
+             write_file(path + ".new", pattern_bytes(300000, 18));
+             std::filesystem::rename(path + ".new", path);
          }},
     };
-    for (const auto &change : changes) {
+    for (const auto &[what, change] : changes) {
         for (int round = 0; round < 2; ++round) {
-            SCOPED_TRACE(std::string(change.what) + " " + std::to_string(round));
+            SCOPED_TRACE(std::string(what) + " " + std::to_string(round));
             write_file(path, old_content);
             std::vector<std::string> versions = {old_content};
-            dpx_status status = rig.checked_get("changing.bin", versions, [&] {
+            dpx_status status = rig.checked(false, "changing.bin", versions, [&] {
                 rig.sleep_random_ms(round == 0 ? 0 : 150);
-                versions.push_back(change.apply(path));
+                change();
+                versions.push_back(read_file(path));
             });
             EXPECT_TRUE(status == DPX_OK || status == DPX_E_FILE_CHANGED) << std::hex << status;
             rig.check_after_fault();
@@ -361,10 +286,9 @@ TEST(Faults, AGetIntoATargetBelowARegularFileFailsAndLeavesNothing)
 {
     Rig rig;
     write_file(rig.hub.depot_file("p.bin"), pattern_bytes(70000, 19));
-    write_file(rig.local("plain"), "plain");
-    std::string target = rig.local("plain/sub/target.bin");
-    EXPECT_EQ(GetFile("node1", "p.bin", target.c_str()), DPX_E_FILE_WRITE);
-    EXPECT_EQ(read_file(rig.local("plain")), "plain");
+    write_file(rig.hub / "plain", "plain");
+    EXPECT_EQ(GetFile("node1", "p.bin", (rig.hub / "plain/sub/target.bin").c_str()), DPX_E_FILE_WRITE);
+    EXPECT_EQ(read_file(rig.hub / "plain"), "plain");
     rig.check_after_fault();
 }
 

@@ -1,90 +1,64 @@
-// The hub and a client on two hosts of their own: network namespaces made by
-// the test, joined by a veth pair, addresses in 10.200.0.0/16 that exist only
-// inside them. The link loses 1 % of the packets each way (the kernel drops
-// them on arrival, so TCP recovers as from a lossy wire) and delays every
-// byte 50 ms each way: this kernel has no delaying queueing discipline, so
-// the hub is reached through a relay in its namespace that holds the bytes,
-// and the daemon advertises the relay. The client is the dpx program, run in
-// its namespace. Skipped where namespaces can't be made.
-#include "client_hub.h"
+// The hub and a client on two hosts of their own: network namespaces joined
+// by a veth pair, addresses in 10.200.0.0/16 that exist only inside them.
+// The link loses 1 % of the packets each way (dropped on arrival, so TCP
+// recovers as from a lossy wire) and delays every byte 50 ms each way: this
+// kernel has no delaying queueing discipline, so the hub is reached through a
+// relay in its namespace that holds the bytes, and the daemon advertises the
+// relay. The client is the dpx program. Skipped where namespaces can't be made.
+#include "hub.h"
 
-#include <cstdlib>
 #include <unistd.h>
-
-using dpxtest::exited_with;
-using dpxtest::Process;
-using dpxtest::TempDir;
 
 namespace {
 
+using namespace dpxtest;
+
 const char kIp[] = "/usr/sbin/ip";
 const char kNft[] = "/usr/sbin/nft";
-constexpr int kDelayMs = 50;
-constexpr int kRelayPort = 7000;
-
-int run(const std::vector<std::string> &argv)
-{
-    Process process(argv, {}, "/dev/null");
-    return process.wait(std::chrono::seconds(30));
-}
+constexpr int kDelayMs = 50, kRelayPort = 7000, kBrokerPort = 1350;
 
 // Two namespaces, "hub" and "client", and the lossy link between them,
 // removed at the end with everything in them.
 class TwoHosts {
 public:
     TwoHosts()
-        : tag_(std::to_string(getpid() % 100000)),
-          hub("dpxh" + tag_),
-          client("dpxc" + tag_),
-          subnet("10.200." + std::to_string(getpid() % 250) + "."),
-          hub_address(subnet + "1"),
-          hub_link("vh" + tag_)
     {
         if (access(kIp, X_OK) != 0 || access(kNft, X_OK) != 0) {
             reason = "needs ip (iproute2) and nft (nftables)";
             return;
         }
-        if (!exited_with(run({kIp, "netns", "add", hub}), 0)) {
+        if (!(made_ = ok({kIp, "netns", "add", hub}))) {
             reason = "cannot make a network namespace: needs CAP_SYS_ADMIN and CAP_NET_ADMIN";
             return;
         }
-        made_ = true;
-        std::string client_link = "vc" + tag_;
-        const std::vector<std::vector<std::string>> steps = {
+        std::vector<std::vector<std::string>> steps = {
             {kIp, "netns", "add", client},
-            {kIp, "link", "add", hub_link, "netns", hub, "type", "veth", "peer", "name", client_link, "netns", client},
-            {kIp, "-n", hub, "addr", "add", subnet + "1/24", "dev", hub_link},
-            {kIp, "-n", client, "addr", "add", subnet + "2/24", "dev", client_link},
-            {kIp, "-n", hub, "link", "set", "lo", "up"},
-            {kIp, "-n", client, "link", "set", "lo", "up"},
-            {kIp, "-n", hub, "link", "set", hub_link, "up"},
-            {kIp, "-n", client, "link", "set", client_link, "up"},
-        };
-        for (const auto &step : steps) {
-            if (!exited_with(run(step), 0)) {
-                reason = "cannot set up the link: " + step[1] + " " + step[2] + " " + step[3];
-                return;
-            }
+            {kIp, "link", "add", hub_link, "netns", hub, "type", "veth", "peer", "name", client_link, "netns", client}};
+        for (const auto &[ns, link, host] : {std::tuple{hub, hub_link, "1"}, std::tuple{client, client_link, "2"}}) {
+            steps.push_back({kIp, "-n", ns, "addr", "add", subnet + host + "/24", "dev", link});
+            steps.push_back({kIp, "-n", ns, "link", "set", "lo", "up"});
+            steps.push_back({kIp, "-n", ns, "link", "set", link, "up"});
+            // One packet in a hundred that arrive over the link is dropped.
+            steps.push_back(in(ns, {kNft, "add table inet dpxloss; add chain inet dpxloss in { type filter hook input "
+                                          "priority 0; }; add rule inet dpxloss in iifname " + link +
+                                          " numgen random mod 100 == 0 counter drop"}));
         }
-        for (const auto &[ns, link] : {std::pair{hub, hub_link}, std::pair{client, client_link}}) {
-            if (!lossy(ns, link)) {
-                reason = "cannot add packet loss with nft: needs nf_tables";
-                return;
-            }
-        }
+        for (const auto &step : steps)
+            if (reason.empty() && !ok(step))
+                reason = "cannot set up the hosts (needs veth and nf_tables): " + step[1] + " " + step[2];
     }
     ~TwoHosts()
     {
         if (made_) {
-            run({kIp, "netns", "del", client});
-            run({kIp, "netns", "del", hub});
+            ok({kIp, "netns", "del", client});
+            ok({kIp, "netns", "del", hub});
         }
     }
-    TwoHosts(const TwoHosts &) = delete;
-    TwoHosts &operator=(const TwoHosts &) = delete;
+
+    static bool ok(const std::vector<std::string> &argv) { return exited_with(run(argv).wstatus, 0); }
 
     // argv run inside namespace `ns`.
-    std::vector<std::string> in(const std::string &ns, std::vector<std::string> argv) const
+    static std::vector<std::string> in(const std::string &ns, std::vector<std::string> argv)
     {
         argv.insert(argv.begin(), {kIp, "netns", "exec", ns});
         return argv;
@@ -93,55 +67,20 @@ public:
     // Packets the loss has dropped on arrival in `ns` so far.
     long dropped(const std::string &ns) const
     {
-        Process list(in(ns, {kNft, "list", "chain", "inet", "dpxloss", "in"}), {}, "/dev/null");
-        auto line = list.wait_line("\t\tiifname");
-        list.wait();
-        size_t at = line ? line->find("packets ") : std::string::npos;
-        return at == std::string::npos ? -1 : std::atol(line->c_str() + at + 8);
+        for (const auto &line : run(in(ns, {kNft, "list", "chain", "inet", "dpxloss", "in"})).out)
+            if (line.find("iifname") != std::string::npos && line.find("packets ") != std::string::npos)
+                return std::atol(line.c_str() + line.find("packets ") + 8);
+        return -1;
     }
 
     std::string reason;  // empty when the hosts are ready
+    const std::string tag = std::to_string(getpid() % 100000), hub = "dpxh" + tag, client = "dpxc" + tag;
+    const std::string subnet = "10.200." + std::to_string(getpid() % 250) + ".", hub_address = subnet + "1";
+    const std::string hub_link = "vh" + tag, client_link = "vc" + tag;
 
 private:
-    // One packet in a hundred that arrive over `link` in `ns` is dropped.
-    bool lossy(const std::string &ns, const std::string &link) const
-    {
-        const std::vector<std::vector<std::string>> steps = {
-            {kNft, "add", "table", "inet", "dpxloss"},
-            {kNft, "add", "chain", "inet", "dpxloss", "in", "{ type filter hook input priority 0; }"},
-            {kNft, "add", "rule", "inet", "dpxloss", "in", "iifname", link, "numgen", "random", "mod", "100", "==",
-             "0", "counter", "drop"},
-        };
-        for (const auto &step : steps) {
-            if (!exited_with(run(in(ns, step)), 0))
-                return false;
-        }
-        return true;
-    }
-
-    std::string tag_;
     bool made_ = false;
-
-public:
-    const std::string hub, client, subnet, hub_address, hub_link;
 };
-
-constexpr int kBrokerPort = 1350;
-
-// The dpx program on the client host; its exit status and standard error.
-std::pair<int, std::string> dpx(const TwoHosts &hosts, const TempDir &dir, std::vector<std::string> args)
-{
-    args.insert(args.begin(), {dpxtest::bin_dir() + "/dpx", "--quiet"});
-    Process process(hosts.in(hosts.client, args),
-                    {{"AFW_HUB_HOST", std::nullopt},
-                     {"DPX_HUBHOST", hosts.hub_address},
-                     {"NCS_LB_PORT", std::to_string(kBrokerPort)},
-                     {"NCS_CALL_TIMEOUT_MS", "10000"},
-                     {"TMPDIR", dir / "tmp"}},
-                    dir / "stderr");
-    int wstatus = process.wait(std::chrono::minutes(14));
-    return {wstatus, dpxtest::read_file(dir / "stderr")};
-}
 
 TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly)
 {
@@ -149,32 +88,37 @@ TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly
     if (!hosts.reason.empty())
         GTEST_SKIP() << hosts.reason;
     TempDir dir;
-    std::filesystem::create_directories(dir / "depot/prod");
-    std::filesystem::create_directories(dir / "tmp");
+    made_dir(dir / "depot/prod");
+    made_dir(dir / "tmp");
     // Under the sanitizers a smaller file crosses.
-    size_t size = std::getenv("DPX_SKIP_SLOW") != nullptr ? (8u << 20) : (100u << 20);
-    dpxtest::write_file(dir / "source.bin", dpxtest::pattern_bytes(size, 21));
+    size_t size = slow_skipped() ? (8u << 20) : (100u << 20);
+    write_file(dir / "source.bin", pattern_bytes(size, 21));
 
-    const std::string relay = hosts.hub_address + ":" + std::to_string(kRelayPort);
-    Process daemon(hosts.in(hosts.hub, {dpxtest::bin_dir() + "/dpx-agentd", "--depot", dir / "depot", "--product",
-                                        "prod", "--listen", hosts.hub_address + ":0", "--hub", "--advertise", relay,
-                                        "--broker"}),
+    Process daemon(hosts.in(hosts.hub, {bin_dir() + "/dpx-agentd", "--depot", dir / "depot", "--product", "prod",
+                                        "--listen", hosts.hub_address + ":0", "--hub", "--advertise",
+                                        hosts.hub_address + ":" + std::to_string(kRelayPort), "--broker"}),
                    {{"NCS_LB_PORT", std::to_string(kBrokerPort)}});
-    auto listening = daemon.wait_line("listening on ");
-    ASSERT_TRUE(listening.has_value());
-    std::string port = listening->substr(listening->rfind(':') + 1);
-    Process delay(hosts.in(hosts.hub, {dpxtest::bin_dir() + "/dpx_test_delay", hosts.hub_address,
-                                       std::to_string(kRelayPort), hosts.hub_address, port,
-                                       std::to_string(kDelayMs)}));
-    ASSERT_TRUE(delay.wait_line("relaying on ").has_value());
+    uint16_t port = listening_port(daemon);
+    ASSERT_NE(port, 0);
+    Process delay(hosts.in(hosts.hub, {bin_dir() + "/dpx_test_delay", hosts.hub_address, std::to_string(kRelayPort),
+                                       hosts.hub_address, std::to_string(port), std::to_string(kDelayMs)}));
+    ASSERT_NE(listening_port(delay, "relaying on "), 0);
+    auto dpx = [&](std::vector<std::string> args) {
+        args.insert(args.begin(), {bin_dir() + "/dpx", "--quiet"});
+        return run(hosts.in(hosts.client, args),
+                   {{"AFW_HUB_HOST", std::nullopt}, {"DPX_HUBHOST", hosts.hub_address},
+                    {"NCS_LB_PORT", std::to_string(kBrokerPort)}, {"NCS_CALL_TIMEOUT_MS", "10000"},
+                    {"TMPDIR", dir / "tmp"}},
+                   std::chrono::minutes(14));
+    };
 
     auto started = std::chrono::steady_clock::now();
-    auto [put, put_err] = dpx(hosts, dir, {"put", "node1", "big.bin", dir / "source.bin"});
-    EXPECT_TRUE(exited_with(put, 0)) << put_err;
-    auto [get, get_err] = dpx(hosts, dir, {"get", "node1", "big.bin", dir / "target.bin"});
-    EXPECT_TRUE(exited_with(get, 0)) << get_err;
-    EXPECT_EQ(dpxtest::compare_files(dir / "source.bin", dir / "depot/prod/big.bin"), "");
-    EXPECT_EQ(dpxtest::compare_files(dir / "source.bin", dir / "target.bin"), "");
+    Ran put = dpx({"put", "node1", "big.bin", dir / "source.bin"});
+    EXPECT_TRUE(exited_with(put.wstatus, 0)) << put.err;
+    Ran get = dpx({"get", "node1", "big.bin", dir / "target.bin"});
+    EXPECT_TRUE(exited_with(get.wstatus, 0)) << get.err;
+    EXPECT_TRUE(same_files(dir / "source.bin", dir / "depot/prod/big.bin"));
+    EXPECT_TRUE(same_files(dir / "source.bin", dir / "target.bin"));
     long dropped_up = hosts.dropped(hosts.hub), dropped_down = hosts.dropped(hosts.client);
     std::printf("%zu bytes up and down a link with %d ms delay each way in %.1f s; packets lost: %ld up, %ld down\n",
                 size, kDelayMs, std::chrono::duration<double>(std::chrono::steady_clock::now() - started).count(),
@@ -185,10 +129,10 @@ TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly
     // The link goes down once a download has begun to arrive: the client
     // fails at its call's time-out and leaves neither a target nor a
     // temporary file.
-    dpxtest::write_file(dir / "depot/prod/cut.bin", dpxtest::pattern_bytes(64u << 20, 22));
+    write_file(dir / "depot/prod/cut.bin", pattern_bytes(64u << 20, 22));
     std::thread cut([&] {
         auto begun = [&] {
-            for (const auto &name : dpxtest::files_with_prefix(dir / "tmp", "cxp")) {
+            for (const auto &name : files_with_prefix(dir / "tmp", "cxp")) {
                 std::error_code ec;
                 if (std::filesystem::file_size(name, ec) > 0 && !ec)
                     return true;
@@ -197,18 +141,18 @@ TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly
         };
         for (int i = 0; i < 60000 && !begun(); ++i)
             std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        run(hosts.in(hosts.hub, {kIp, "link", "set", hosts.hub_link, "down"}));
+        TwoHosts::ok(hosts.in(hosts.hub, {kIp, "link", "set", hosts.hub_link, "down"}));
     });
     auto cut_at = std::chrono::steady_clock::now();
-    auto [lost, lost_err] = dpx(hosts, dir, {"get", "node1", "cut.bin", dir / "lost.bin"});
+    Ran lost = dpx({"get", "node1", "cut.bin", dir / "lost.bin"});
     cut.join();
     // The call's time-out (10 s here) bounds the wait: a time-out is never
     // repeated. The rest is room for a busy machine.
     EXPECT_LT(std::chrono::steady_clock::now() - cut_at, std::chrono::seconds(40));
-    EXPECT_TRUE(exited_with(lost, 1)) << lost_err;
-    EXPECT_EQ(lost_err.rfind("0x1C01", 0), 0u) << "not a communication failure: " << lost_err;
-    EXPECT_FALSE(dpxtest::file_exists(dir / "lost.bin"));
-    EXPECT_TRUE(dpxtest::files_with_prefix(dir / "tmp", "cxp").empty());
+    EXPECT_TRUE(exited_with(lost.wstatus, 1)) << lost.err;
+    EXPECT_EQ(lost.err.rfind("0x1C01", 0), 0u) << "not a communication failure: " << lost.err;
+    EXPECT_FALSE(file_exists(dir / "lost.bin"));
+    EXPECT_TRUE(files_with_prefix(dir / "tmp", "cxp").empty());
 
     delay.signal(SIGKILL);
     daemon.signal(SIGTERM);

@@ -60,15 +60,10 @@ struct Call {
     dpx_status status = 0;
     std::vector<dpx_chunk> chunks;
     std::vector<dpx_node_name> nodes;
+    dpx_query_text query{};
+    dpx_node_filter filter{};
 
     explicit Call(int16_t max) : max(max), chunks(static_cast<size_t>(max + 1)), nodes(static_cast<size_t>(max + 1)) {}
-
-    // What the caller may rely on after any reply: `last` within its array.
-    void check() const
-    {
-        if (last < -1 || last > max)
-            std::abort();
-    }
 };
 
 void through_stub(uint32_t opnum, Call &call)
@@ -83,15 +78,11 @@ void through_stub(uint32_t opnum, Call &call)
         dpx_put_chunks_csr(handle, call.desc, call.crc, call.state, &call.last, call.max, &call.status,
                            call.chunks.data());
         break;
-    case DPX_OP_AGENT_QUERY: {
-        dpx_query_text query{};
-        dpx_agent_query_csr(handle, query, call.desc, &call.result, &call.status);
+    case DPX_OP_AGENT_QUERY:
+        dpx_agent_query_csr(handle, call.query, call.desc, &call.result, &call.status);
         break;
-    }
-    default: {
-        dpx_node_filter filter{};
-        dpx_list_nodes_csr(handle, filter, &call.last, call.max, &call.status, call.nodes.data());
-    }
+    default:
+        dpx_list_nodes_csr(handle, call.filter, &call.last, call.max, &call.status, call.nodes.data());
     }
 }
 
@@ -137,6 +128,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
             std::abort();
         EXC1_Allow();
     }
-    call.check();
+    // What the caller may rely on after any reply: `last` within its array.
+    if (call.last < -1 || call.last > call.max)
+        std::abort();
     return 0;
 }

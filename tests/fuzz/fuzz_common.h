@@ -11,22 +11,16 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <string>
 
 namespace dpxfuzz {
 
-// The depot every target resolves into: /fuzz-depot, product "prod". The
-// targets never touch the file system through it.
-constexpr char kRoot[] = "/fuzz-depot";
-constexpr char kProduct[] = "prod";
+// The depot every target resolves into, never touching the file system.
 constexpr char kProductDir[] = "/fuzz-depot/prod/";
 
 inline void set_depot()
 {
-    static const bool done = [] {
-        setenv("DPX_DEPOTROOT", kRoot, 1);
-        AFW_SetProductName(kProduct);
-        return true;
-    }();
+    static const bool done = (setenv("DPX_DEPOTROOT", "/fuzz-depot", 1), AFW_SetProductName("prod"), true);
     (void)done;
 }
 
@@ -43,22 +37,9 @@ inline uint32_t sender_drep(uint8_t choice)
 // the text alone: the prefix, and no ".." segment behind it.
 inline bool inside_product(const char *full)
 {
-    size_t prefix = std::strlen(kProductDir);
-    if (std::strncmp(full, kProductDir, prefix) != 0)
-        return false;
-    const char *rest = full + prefix;
-    if (*rest == '/')
-        return false;
-    for (const char *segment = rest; *segment != '\0';) {
-        const char *end = std::strchr(segment, '/');
-        size_t length = end != nullptr ? static_cast<size_t>(end - segment) : std::strlen(segment);
-        if (length == 2 && segment[0] == '.' && segment[1] == '.')
-            return false;
-        if (end == nullptr)
-            break;
-        segment = end + 1;
-    }
-    return true;
+    const size_t prefix = std::strlen(kProductDir);
+    return std::strncmp(full, kProductDir, prefix) == 0 && full[prefix] != '/' &&
+           ("/" + std::string(full + prefix) + "/").find("/../") == std::string::npos;
 }
 
 }  // namespace dpxfuzz

@@ -1,6 +1,6 @@
 // The server stubs' reading of a request, for all four operations and every
-// representation of the sender, with managers that only check that what the
-// stub hands them lies within its bounds.
+// representation of the sender, with managers that check that what the stub
+// hands them lies within its bounds.
 //
 // Input: byte 0 picks the operation (bits 0-1), the sender's representation
 // (bits 2-4) and the room offered for the reply (bits 5-6); the rest is the
@@ -18,40 +18,44 @@ namespace {
 // one call in 256 (by the state byte or filter) tries that.
 constexpr uint8_t kBreakLast = 0xEE;
 
-// Every record of the array is written: the stub has to provide max + 1.
-void touch_chunks(dpx_chunk buffer[], int16_t max)
+void check_array(int16_t last, int16_t max)
 {
-    for (int32_t i = 0; i <= max; ++i) {
-        buffer[i].index = static_cast<uint32_t>(i);
-        buffer[i].length = static_cast<uint32_t>(i) % (DPX_CHUNK_SIZE + 1);
-        buffer[i].data[DPX_CHUNK_SIZE - 1] = 0;
-    }
+    if (max >= DPX_RPC_MAX_ELEMENTS || last < -1 || last > max)
+        std::abort();
 }
 
 void check_path(const char (&path)[DPX_PATH_LEN])
 {
     char full[DPX_PATH_LEN];
-    if (dpx_get_full_path_of_field(path, sizeof path, full, sizeof full) == DPX_OK &&
-        !dpxfuzz::inside_product(full))
+    if (dpx_get_full_path_of_field(path, sizeof path, full, sizeof full) == DPX_OK && !dpxfuzz::inside_product(full))
         std::abort();
+}
+
+// Checks the records that arrived and writes all max + 1 that the stub has to provide.
+uint32_t take_chunks(dpx_chunk buffer[], int16_t last, int16_t max)
+{
+    uint32_t arrived = 0;
+    dpx_checksum_xfer_buff(buffer, static_cast<int16_t>(last + 1), &arrived);
+    for (int32_t i = 0; i <= max; ++i) {
+        buffer[i].index = static_cast<uint32_t>(i);
+        buffer[i].length = static_cast<uint32_t>(i) % (DPX_CHUNK_SIZE + 1);
+        buffer[i].data[DPX_CHUNK_SIZE - 1] = 0;
+    }
+    return arrived;
 }
 
 int16_t answer_last(int16_t max, uint32_t word, uint8_t breaker)
 {
-    if (breaker == kBreakLast)
-        return static_cast<int16_t>(max + 1);
-    return static_cast<int16_t>(static_cast<int32_t>(word % (static_cast<uint32_t>(max) + 2)) - 1);
+    const auto answered = static_cast<int32_t>(word % (static_cast<uint32_t>(max) + 2)) - 1;
+    return static_cast<int16_t>(breaker == kBreakLast ? max + 1 : answered);
 }
 
 void fuzz_get_chunks(handle_t, dpx_file_desc *desc, uint32_t *crc, uint8_t *state, uint32_t *index, int16_t *last,
                      int16_t max, dpx_status *status, dpx_chunk buffer[])
 {
-    if (max >= DPX_RPC_MAX_ELEMENTS || *last < -1 || *last > max)
-        std::abort();
+    check_array(*last, max);
     check_path(desc->path);
-    uint32_t arrived = 0;
-    dpx_checksum_xfer_buff(buffer, static_cast<int16_t>(*last + 1), &arrived);
-    touch_chunks(buffer, max);
+    uint32_t arrived = take_chunks(buffer, *last, max);
     *last = answer_last(max, *crc ^ *index, *state);
     *crc = arrived;
     *status = DPX_OK;
@@ -60,15 +64,11 @@ void fuzz_get_chunks(handle_t, dpx_file_desc *desc, uint32_t *crc, uint8_t *stat
 void fuzz_put_chunks(handle_t, dpx_file_desc desc, uint32_t crc, uint8_t state, int16_t *last, int16_t max,
                      dpx_status *status, dpx_chunk buffer[])
 {
-    if (max >= DPX_RPC_MAX_ELEMENTS || *last < -1 || *last > max)
-        std::abort();
+    check_array(*last, max);
     check_path(desc.path);
-    uint32_t arrived = 0;
-    dpx_checksum_xfer_buff(buffer, static_cast<int16_t>(*last + 1), &arrived);
-    touch_chunks(buffer, max);
+    *status = take_chunks(buffer, *last, max) == crc ? DPX_OK : DPX_E_CHECKSUM;
     if (state == kBreakLast)
         *last = static_cast<int16_t>(max + 1);
-    *status = arrived == crc ? DPX_OK : DPX_E_CHECKSUM;
 }
 
 void fuzz_agent_query(handle_t, dpx_query_text query, dpx_file_desc desc, uint32_t *result, dpx_status *status)
@@ -81,8 +81,7 @@ void fuzz_agent_query(handle_t, dpx_query_text query, dpx_file_desc desc, uint32
 void fuzz_list_nodes(handle_t, dpx_node_filter filter, int16_t *last, int16_t max, dpx_status *status,
                      dpx_node_name nodes[])
 {
-    if (max >= DPX_RPC_MAX_ELEMENTS || *last < -1 || *last > max)
-        std::abort();
+    check_array(*last, max);
     for (int32_t i = 0; i <= max; ++i)
         nodes[i][DPX_NODE_LEN - 1] = filter[i % DPX_FILTER_LEN];
     *last = answer_last(max, static_cast<unsigned char>(filter[0]), static_cast<uint8_t>(filter[1]));
@@ -100,11 +99,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     if (size < 1)
         return 0;
     dpxfuzz::set_depot();
-    const uint32_t opnum = data[0] & 3u;
     uint32_t drep = dpxfuzz::sender_drep(static_cast<uint8_t>(data[0] >> 2));
-    const uint32_t out_max = kOfferedRoom[(data[0] >> 5) & 3u];
-    const uint32_t body_len = static_cast<uint32_t>(size - 1);
-
+    const uint32_t out_max = kOfferedRoom[(data[0] >> 5) & 3u], body_len = static_cast<uint32_t>(size - 1);
     // An odd data_offs: a body's alignment must not depend on it. Both
     // buffers end exactly where the stub may use them.
     constexpr uint16_t kDataOffs = 7;
@@ -112,14 +108,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     std::unique_ptr<unsigned char[]> in(new unsigned char[kDataOffs + body_len]);
     std::memcpy(in.get() + kDataOffs, data + 1, body_len);
     std::unique_ptr<unsigned char[]> out(new unsigned char[kDataOffs + out_max]);
-
     void *reply_pkt = nullptr;
-    uint32_t reply_len = 0;
+    uint32_t reply_len = 0, st = 1;
     unsigned char must_free = 0;
-    uint32_t st = 1;
     try {
-        dpx_transfer_v1_server_epva[opnum](&handle, in.get(), body_len, out.get(), out_max, &drep, &kManagers,
-                                           &reply_pkt, &reply_len, &must_free, &st);
+        dpx_transfer_v1_server_epva[data[0] & 3u](&handle, in.get(), body_len, out.get(), out_max, &drep, &kManagers,
+                                                 &reply_pkt, &reply_len, &must_free, &st);
     } catch (const exc::Fault &fault) {
         // A refused request: the only fault the stubs raise here.
         if (fault.status != DPX_RPC_FAULT_INVALID_BOUND)

@@ -1,24 +1,26 @@
-// A TCP relay that holds every byte for a fixed time in each direction: the
-// delay of a long link, for kernels without a queueing discipline that
-// delays. Accepts on HOST:PORT, connects each client to TARGET:TPORT, and
-// passes what either side sends on DELAY_MS later, in order. An end's close
-// reaches the other end after the bytes before it. Prints "relaying on
+// A TCP relay that holds every byte DELAY_MS in each direction: the delay of
+// a long link, for kernels without a delaying queueing discipline. Accepts on
+// HOST:PORT and connects each client to TARGET:TPORT; an end's close reaches
+// the other end after the bytes before it. With "up" or "down", the first
+// CUTS connections are cut both ways once LIMIT bytes have passed upstream
+// (client to target) or downstream, and "cut" is printed. Prints "relaying on
 // HOST:PORT" when ready; runs until killed.
 //
-// usage: dpx_test_delay HOST PORT TARGET TPORT DELAY_MS
+// usage: dpx_test_delay HOST PORT TARGET TPORT DELAY_MS [up|down LIMIT CUTS]
+#include <algorithm>
 #include <arpa/inet.h>
+#include <atomic>
+#include <cerrno>
 #include <chrono>
 #include <condition_variable>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <deque>
-#include <memory>
 #include <mutex>
-#include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <string>
-#include <sys/socket.h>
 #include <thread>
 #include <unistd.h>
 #include <vector>
@@ -27,27 +29,16 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-class Fd {
-public:
-    explicit Fd(int fd = -1) : fd_(fd) {}
-    ~Fd()
-    {
-        if (fd_ >= 0)
-            close(fd_);
-    }
+struct Fd {
+    explicit Fd(int fd) : fd(fd) {}
+    ~Fd() { close(fd); }
     Fd(const Fd &) = delete;
-    Fd &operator=(const Fd &) = delete;
-    int get() const { return fd_; }
-
-private:
-    int fd_;
+    const int fd;
 };
 
 sockaddr_in address_of(const char *host, const char *port)
 {
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_port = htons(static_cast<uint16_t>(std::atoi(port)));
+    sockaddr_in a{AF_INET, htons(static_cast<uint16_t>(std::atoi(port))), {}, {}};
     if (inet_pton(AF_INET, host, &a.sin_addr) != 1) {
         std::fprintf(stderr, "dpx_test_delay: not an IPv4 address: %s\n", host);
         std::exit(2);
@@ -55,26 +46,32 @@ sockaddr_in address_of(const char *host, const char *port)
     return a;
 }
 
-// Bytes in flight from one socket to another: a reader stamps what it
-// receives, a writer sends each piece once its time has come. An empty piece
-// is the sender's end.
+// Bytes in flight from one socket to another: the reader stamps what it
+// receives, the writer sends each piece once its time has come. An empty
+// piece is the end: the sender's close, or the cut after `budget` bytes.
 class Direction {
 public:
-    Direction(int from, int to, std::chrono::milliseconds delay) : from_(from), to_(to), delay_(delay) {}
+    Direction(int from, int to, std::chrono::milliseconds delay, uint64_t budget)
+        : from_(from), to_(to), delay_(delay), budget_(budget)
+    {
+    }
 
     void run()
     {
         std::thread writer([this] { write_loop(); });
         std::vector<char> piece(64 * 1024);
-        for (;;) {
-            ssize_t n = recv(from_, piece.data(), piece.size(), 0);
+        for (bool more = true; more;) {
+            ssize_t n = recv(from_, piece.data(), std::min<uint64_t>(piece.size(), budget_), 0);
             if (n < 0 && errno == EINTR)
                 continue;
+            budget_ -= n > 0 ? static_cast<uint64_t>(n) : 0;
+            more = n > 0 && budget_ > 0;
             std::lock_guard<std::mutex> hold(mutex_);
-            queue_.push_back({Clock::now() + delay_, std::string(piece.data(), n > 0 ? static_cast<size_t>(n) : 0)});
+            if (n > 0)
+                queue_.push_back({Clock::now() + delay_, std::string(piece.data(), static_cast<size_t>(n))});
+            if (!more)
+                queue_.push_back({Clock::now() + delay_, std::string()});
             ready_.notify_one();
-            if (n <= 0)
-                break;
         }
         writer.join();
     }
@@ -97,7 +94,9 @@ private:
             }
             std::this_thread::sleep_until(piece.due);
             if (piece.bytes.empty()) {
-                shutdown(to_, SHUT_WR);
+                if (budget_ == 0)
+                    std::printf("cut\n"), std::fflush(stdout), shutdown(from_, SHUT_RDWR);
+                shutdown(to_, budget_ == 0 ? SHUT_RDWR : SHUT_WR);
                 return;
             }
             for (size_t sent = 0; sent < piece.bytes.size();) {
@@ -116,20 +115,22 @@ private:
 
     int from_, to_;
     std::chrono::milliseconds delay_;
+    std::atomic<uint64_t> budget_;
     std::mutex mutex_;
     std::condition_variable ready_;
     std::deque<Piece> queue_;
 };
 
-void relay(std::shared_ptr<Fd> client, sockaddr_in target, std::chrono::milliseconds delay)
+void relay(int client_fd, sockaddr_in target, std::chrono::milliseconds delay, uint64_t up_budget,
+           uint64_t down_budget)
 {
-    auto server = std::make_shared<Fd>(socket(AF_INET, SOCK_STREAM, 0));
-    if (connect(server->get(), reinterpret_cast<sockaddr *>(&target), sizeof target) != 0)
+    Fd client(client_fd), server(socket(AF_INET, SOCK_STREAM, 0));
+    if (connect(server.fd, reinterpret_cast<sockaddr *>(&target), sizeof target) != 0)
         return;
     int one = 1;
-    setsockopt(client->get(), IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
-    setsockopt(server->get(), IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
-    Direction up(client->get(), server->get(), delay), down(server->get(), client->get(), delay);
+    setsockopt(client.fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+    setsockopt(server.fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+    Direction up(client.fd, server.fd, delay, up_budget), down(server.fd, client.fd, delay, down_budget);
     std::thread upstream([&] { up.run(); });
     down.run();
     upstream.join();
@@ -139,35 +140,38 @@ void relay(std::shared_ptr<Fd> client, sockaddr_in target, std::chrono::millisec
 
 int main(int argc, char **argv)
 {
-    if (argc != 6) {
-        std::fprintf(stderr, "usage: dpx_test_delay HOST PORT TARGET TPORT DELAY_MS\n");
+    if (argc != 6 && argc != 9) {
+        std::fprintf(stderr, "usage: dpx_test_delay HOST PORT TARGET TPORT DELAY_MS [up|down LIMIT CUTS]\n");
         return 2;
     }
     std::signal(SIGPIPE, SIG_IGN);
-    sockaddr_in listen_at = address_of(argv[1], argv[2]);
-    sockaddr_in target = address_of(argv[3], argv[4]);
+    sockaddr_in listen_at = address_of(argv[1], argv[2]), target = address_of(argv[3], argv[4]);
     std::chrono::milliseconds delay(std::atoi(argv[5]));
+    bool cut_up = argc == 9 && std::strcmp(argv[6], "up") == 0;
+    uint64_t limit = argc == 9 ? std::strtoull(argv[7], nullptr, 10) : UINT64_MAX;
+    int cuts_left = argc == 9 ? std::atoi(argv[8]) : 0;
 
     Fd listener(socket(AF_INET, SOCK_STREAM, 0));
     int one = 1;
-    setsockopt(listener.get(), SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+    setsockopt(listener.fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
     socklen_t len = sizeof listen_at;
-    if (bind(listener.get(), reinterpret_cast<sockaddr *>(&listen_at), sizeof listen_at) != 0 ||
-        listen(listener.get(), 64) != 0 ||
-        getsockname(listener.get(), reinterpret_cast<sockaddr *>(&listen_at), &len) != 0) {
+    if (bind(listener.fd, reinterpret_cast<sockaddr *>(&listen_at), sizeof listen_at) != 0 ||
+        listen(listener.fd, 64) != 0 || getsockname(listener.fd, reinterpret_cast<sockaddr *>(&listen_at), &len) != 0) {
         std::perror("dpx_test_delay: listen");
         return 1;
     }
     std::printf("relaying on %s:%u\n", argv[1], ntohs(listen_at.sin_port));
     std::fflush(stdout);
     for (;;) {
-        int fd = accept(listener.get(), nullptr, nullptr);
-        if (fd < 0) {
-            if (errno == EINTR || errno == ECONNABORTED)
-                continue;
+        int fd = accept(listener.fd, nullptr, nullptr);
+        if (fd < 0 && errno != EINTR && errno != ECONNABORTED) {
             std::perror("dpx_test_delay: accept");
             return 1;
         }
-        std::thread(relay, std::make_shared<Fd>(fd), target, delay).detach();
+        bool cutting = fd >= 0 && cuts_left-- > 0;
+        if (fd >= 0)
+            std::thread(relay, fd, target, delay, cutting && cut_up ? limit : UINT64_MAX,
+                        cutting && !cut_up ? limit : UINT64_MAX)
+                .detach();
     }
 }

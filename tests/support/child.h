@@ -8,9 +8,8 @@
 
 namespace dpxtest {
 
-// Runs `body` in a child process. The child exits 0 when `body` returns an
-// empty string, else prints it and exits 1. Returns what the child reported:
-// empty on success.
+// Runs `body` in a child process, which reports what `body` returns: empty
+// for success. Returns that report, or why the child failed without one.
 std::string in_child(const std::function<std::string()> &body);
 
 }  // namespace dpxtest

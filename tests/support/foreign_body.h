@@ -43,14 +43,11 @@ struct Message {
     uint32_t crc = 0;
     uint8_t state = 0;
     uint32_t index = 0;
-    int16_t last = -1;
-    int16_t max = -1;
-    uint32_t status = 0;
-    uint32_t result = 0;
+    int16_t last = -1, max = -1;
+    uint32_t status = 0, result = 0;
     dpx_query_text query{};
     dpx_node_filter filter{};
-    std::optional<uint16_t> size_word{};
-    std::optional<uint16_t> count_word{};
+    std::optional<uint16_t> size_word{}, count_word{};
     std::vector<dpx_chunk> chunks{};
     std::vector<Node> nodes{};
 
@@ -62,8 +59,7 @@ struct Message {
 bool operator==(const Message &a, const Message &b);
 
 enum class Field { desc, crc, state, index, last, max, status, result, query, filter, size, count, chunks, nodes };
-// A body's fields in order, each at its offset; the bytes between them are
-// gaps.
+// A body's fields in order, each at its offset; the bytes between them are gaps.
 using Layout = std::vector<std::pair<Field, uint32_t>>;
 
 extern const Layout kGetChunksRequest, kGetChunksReply, kPutChunksRequest, kPutChunksReply, kAgentQueryRequest,

@@ -1,6 +1,5 @@
-// A small RPC interface of the tests' own, whose server stubs echo, count,
-// raise or wait, and a client helper that makes one call with rpc__sar.
-// Header-only, so that the benchmark uses the very same interface.
+// An RPC interface of the tests' own, whose server stubs echo, count, raise
+// or wait, and one call of it with rpc__sar. Header-only: the benchmark uses it too.
 #ifndef DPX_TEST_NCS_ECHO_H
 #define DPX_TEST_NCS_ECHO_H
 
@@ -63,15 +62,13 @@ inline const rpc__server_stub_t kServerStubs[kOpCount] = {stub<kEcho>, stub<kEch
 inline uint32_t register_interface()
 {
     uint32_t status = 1;
-    rpc__register_mgr(&uuid__nil, &kInterface, kServerStubs, nullptr, &status);
-    return status;
+    return rpc__register_mgr(&uuid__nil, &kInterface, kServerStubs, nullptr, &status), status;
 }
 
 inline uint32_t unregister_interface()
 {
     uint32_t status = 1;
-    rpc__unregister(&kInterface, &status);
-    return status;
+    return rpc__unregister(&kInterface, &status), status;
 }
 
 struct Outcome {

@@ -1,5 +1,5 @@
-// Fixtures shared by the suites: temporary directories, files, trace capture,
-// environment variables set for the length of a scope.
+// Fixtures shared by the suites: temporary directories and files, trace
+// capture, environment variables set for the length of a scope.
 #ifndef DPX_TEST_SUPPORT_H
 #define DPX_TEST_SUPPORT_H
 
@@ -10,7 +10,7 @@
 
 namespace dpxtest {
 
-// A fresh directory under $TMPDIR (or /tmp), removed with everything in it.
+// A fresh directory under $TMPDIR (or /tmp), removed with all in it.
 class TempDir {
 public:
     TempDir();
@@ -24,17 +24,16 @@ private:
     std::string path_;
 };
 
-// Whole-file helpers; they fail the test (and return empty) on error.
+// Whole files; a failure fails the test.
 void write_file(const std::string &path, const std::string &bytes);
 std::string read_file(const std::string &path);
 bool file_exists(const std::string &path);
-// Deterministic pseudo-random content of `size` bytes.
+// Deterministic pseudo-random bytes.
 std::string pattern_bytes(size_t size, uint32_t seed = 1);
-// Files in `dir` whose name begins with `prefix`.
 std::vector<std::string> files_with_prefix(const std::string &dir, const std::string &prefix);
 
 // Sets (or, with nullopt, unsets) an environment variable until the end of
-// the scope, then restores it.
+// the scope.
 class ScopedEnv {
 public:
     ScopedEnv(std::string name, std::optional<std::string> value);
@@ -47,15 +46,14 @@ private:
     std::optional<std::string> old_;
 };
 
-// Routes the tracing library to a file with the given flags for the length of
-// the scope; text() reads back what was written.
+// The tracing library writes to a file with `flags` for the length of the scope.
 class TraceCapture {
 public:
     explicit TraceCapture(uint32_t flags);
     ~TraceCapture();
     TraceCapture(const TraceCapture &) = delete;
     TraceCapture &operator=(const TraceCapture &) = delete;
-    std::string text() const;
+    std::string text() const { return read_file(file_); }
     bool contains(const std::string &needle) const { return text().find(needle) != std::string::npos; }
     size_t count(const std::string &needle) const;
 
