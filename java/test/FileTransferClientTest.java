@@ -2,7 +2,6 @@ import com.orvane.quill.flowgauge.core.ft.client.FileTransferClient;
 
 import java.io.*;
 import java.lang.management.ManagementFactory;
-import java.net.ServerSocket;
 import java.nio.file.*;
 import java.util.*;
 import java.util.concurrent.*;
@@ -12,9 +11,9 @@ import java.util.stream.*;
 /**
  * FileTransferClient against real hubs in separate processes. The natives
  * read their hub, depot root, product and node name from the environment, so
- * for each scenario this driver starts one JVM, with the scenario's
- * environment and its own JVM flags (-Xcheck:jni), that starts its hub and
- * runs the checks. The driver adds up the counts and fails a scenario on any
+ * for each scenario this driver starts a location broker (dpx-lbd, on a port
+ * it picks itself) and one JVM, with the scenario's environment and its own
+ * JVM flags (-Xcheck:jni), that starts its hub and runs the checks. The driver adds up the counts and fails a scenario on any
  * -Xcheck:jni warning.
  *
  * usage: FileTransferClientTest AGENTD TEST_PEER SCENARIO... (daemon, peer, names, unset)
@@ -56,11 +55,18 @@ public class FileTransferClientTest {
         command.addAll(List.of("-cp", System.getProperty("java.class.path"), "FileTransferClientTest",
                                "--scenario", scenario, agentd, peer, work.toString()));
         // -Xcheck:jni warns on standard output, the JVM's own messages go to standard error: both are read.
+        // The broker takes a free port and tells it: no port to guess and race for.
+        ProcessBuilder brokerBuilder = new ProcessBuilder(Path.of(agentd).resolveSibling("dpx-lbd").toString())
+                                           .redirectError(ProcessBuilder.Redirect.INHERIT);
+        brokerBuilder.environment().putAll(Map.of("NCS_LB_PORT", "0", "TRC1_FLAGS", "0x80"));
+        Process broker = brokerBuilder.start();
+        String listening = new BufferedReader(new InputStreamReader(broker.getInputStream())).readLine();
+        check(listening != null && listening.startsWith("listening on "), scenario + ": the broker starts");
+        String brokerPort = listening == null ? "0" : listening.substring(listening.lastIndexOf(':') + 1);
         ProcessBuilder builder = new ProcessBuilder(command).redirectErrorStream(true);
         Map<String, String> env = builder.environment();
         env.keySet().removeAll(List.of("DPX_DEPOTROOT", "VESPERHOME", "AFW_PRODUCT", "AFW_HUB_HOST"));
-        env.putAll(Map.of("DPX_HUBHOST", "127.0.0.1", "NCS_LB_PORT", Integer.toString(freePort()),
-                          "AFW_ORIGIN_NODE", ORIGIN));
+        env.putAll(Map.of("DPX_HUBHOST", "127.0.0.1", "NCS_LB_PORT", brokerPort, "AFW_ORIGIN_NODE", ORIGIN));
         if (scenario.equals("daemon"))
             env.putAll(Map.of("DPX_DEPOTROOT", work.resolve("depot").toString(), "AFW_PRODUCT", "prod"));
         Process child = builder.start();
@@ -74,6 +80,8 @@ public class FileTransferClientTest {
                 counts.add(line);
         });
         check(child.waitFor() == 0, scenario + ": the JVM runs its checks and exits with 0");
+        broker.destroy();
+        broker.waitFor();
         check(counts.size() == 1, scenario + ": the JVM reports its counts");
         for (String line : counts) {
             passed += Integer.parseInt(line.split(" ")[0]);
@@ -81,12 +89,6 @@ public class FileTransferClientTest {
         }
         check(warnings.isEmpty(), scenario + ": no -Xcheck:jni warnings, saw " + warnings);
         deleteTree(work);
-    }
-
-    static int freePort() throws IOException {
-        try (ServerSocket socket = new ServerSocket(0)) {
-            return socket.getLocalPort();
-        }
     }
 
     /** Hands each line to sink until the stream ends or is closed. */
@@ -141,13 +143,13 @@ public class FileTransferClientTest {
         switch (scenario) {
             case "daemon" -> {
                 new Hub(work, agentd, "--depot", work.resolve("depot").toString(), "--product", "prod",
-                        "--broker", "--hub");
+                        "--hub");
                 daemon(client, work, work.resolve("depot").resolve("prod"));
             }
             case "peer" ->
-                peer(client, new Hub(work, peer, "--broker", "--hub", "--nodes", "a,b,c", "--query-result", "7"), work);
+                peer(client, new Hub(work, peer, "--hub", "--nodes", "a,b,c", "--query-result", "7"), work);
             case "names" -> {
-                new Hub(work, peer, "--broker", "--hub", "--nodes", String.join(",", manyNames()));
+                new Hub(work, peer, "--hub", "--nodes", String.join(",", manyNames()));
                 names(client);
             }
             case "unset" -> {
