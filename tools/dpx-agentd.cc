@@ -17,7 +17,7 @@ namespace {
 
 const char kUsage[] =
     "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub]\n"
-    "                  [--advertise HOST:PORT] [--broker] [--confine]\n"
+    "                  [--advertise HOST:PORT] [--renew SECONDS] [--broker] [--confine]\n"
     "\n"
     "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
     "\n"
@@ -30,6 +30,10 @@ const char kUsage[] =
     "  --advertise HOST:PORT  the address registered with --hub, when clients reach this\n"
     "                      server elsewhere than where it listens (a wildcard --listen,\n"
     "                      a relay or a forwarded port); default: the address listened on\n"
+    "  --renew SECONDS     with --hub and a broker in another process (dpx-lbd): register\n"
+    "                      again this often, so that a broker that was restarted, and\n"
+    "                      lost its entries, learns of this server again (default 10;\n"
+    "                      0: never)\n"
     "  --broker            run the location broker inside this process, on the broker port\n"
     "  --confine           refuse (0xF11E0001) a path whose real location, symbolic links\n"
     "                      resolved, leaves DIR/NAME; off by default, when links in the\n"
@@ -58,6 +62,7 @@ struct Options {
     std::string advertise_host;  // empty: register the address listened on
     uint32_t advertise_port = 0;
     uint32_t threads = 8;
+    uint32_t renew_s = 10;
     bool hub = false;
     bool broker = false;
     bool confine = false;
@@ -135,6 +140,13 @@ int main(int argc, char **argv)
             if (v == nullptr || *end != '\0' || n == 0 || n > 64)
                 return usage_error("--threads wants a number from 1 to 64");
             options.threads = static_cast<uint32_t>(n);
+        } else if (arg == "--renew") {
+            const char *v = value("--renew");
+            char *end = nullptr;
+            unsigned long n = v != nullptr ? std::strtoul(v, &end, 10) : 0;
+            if (v == nullptr || *end != '\0' || n > 86400)
+                return usage_error("--renew wants a number of seconds from 0 to 86400");
+            options.renew_s = static_cast<uint32_t>(n);
         } else if (arg == "--hub") {
             options.hub = true;
         } else if (arg == "--broker") {
@@ -195,13 +207,15 @@ int main(int argc, char **argv)
 
     lb__entry_t entry;
     std::memset(&entry, 0, sizeof entry);
+    bool registered = false;
     if (options.hub) {
         uuid__decode(DPX_HUB_LB_UUID, &entry.obj_interface, &status);
         std::snprintf(entry.annotation, sizeof entry.annotation, "dpx hub %s", options.product.c_str());
         entry.saddr = advertised_len != 0 ? advertised : bound;
         entry.saddr_len = advertised_len != 0 ? advertised_len : bound_len;
         lb__register(&entry, &status);
-        if (status != rpc__s_ok)
+        registered = status == rpc__s_ok;
+        if (!registered)
             log_line("cannot register in the location broker", status);
     }
 
@@ -216,8 +230,30 @@ int main(int argc, char **argv)
                  options.product.c_str(), options.threads, options.hub ? ", hub" : "",
                  options.broker ? ", broker" : "");
 
-    int signal_number = 0;
-    sigwait(&stop_signals, &signal_number);
+    // Registering again replaces the entry at a broker that has it and makes
+    // it anew at one that was restarted. The embedded broker goes and comes
+    // with this process: nothing to renew.
+    const bool renew = options.hub && !options.broker && options.renew_s > 0;
+    int signal_number = -1;
+    while (signal_number < 0) {
+        if (!renew) {
+            sigwait(&stop_signals, &signal_number);
+            break;
+        }
+        const timespec wait = {static_cast<time_t>(options.renew_s), 0};
+        signal_number = sigtimedwait(&stop_signals, nullptr, &wait);
+        if (signal_number >= 0)
+            break;
+        lb__register(&entry, &status);
+        // Only changes are logged: a broker that stays down is one line.
+        if ((status == rpc__s_ok) != registered) {
+            if (status == rpc__s_ok)
+                std::fprintf(stderr, "dpx-agentd: registered in the location broker again\n");
+            else
+                log_line("cannot register in the location broker", status);
+            registered = status == rpc__s_ok;
+        }
+    }
     std::fprintf(stderr, "dpx-agentd: signal %d, stopping\n", signal_number);
 
     // Out of the broker first, so that no client finds this server any more;

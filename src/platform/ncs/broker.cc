@@ -132,7 +132,10 @@ public:
         std::memcpy(clean.saddr.bytes, entry.saddr.bytes, entry.saddr_len);
 
         std::lock_guard lock(mutex_);
-        std::erase_if(records_, [&](const Record &r) { return same_key(r.entry, clean); });
+        auto same = [&](const Record &r) { return same_key(r.entry, clean); };
+        auto old = std::find_if(records_.begin(), records_.end(), same);
+        const bool renewed = old != records_.end() && old->owner == owner;
+        std::erase_if(records_, same);
         if (records_.size() >= kMaxEntries) {
             TRC1_ERROR_MSG("database full: %s refused", describe(clean).c_str());
             return lb__s_database_full;
@@ -140,8 +143,10 @@ public:
         if (next_serial_ > kMaxSerial)
             renumber();
         records_.push_back(Record{clean, next_serial_++, owner});
-        TRC1_FLOW_MSG("registered %s (connection %llu)", describe(clean).c_str(),
-                      static_cast<unsigned long long>(owner));
+        // A server that renews its own entry is no news.
+        if (!renewed)
+            TRC1_FLOW_MSG("registered %s (connection %llu)", describe(clean).c_str(),
+                          static_cast<unsigned long long>(owner));
         return rpc__s_ok;
     }
 
