@@ -95,9 +95,11 @@ TEST_F(EmbeddedBroker, WalkGivesMatchingEntriesNewestFirstUntilTheyAreUnregister
         EXPECT_EQ(passed_over, 1);
     }
     EXPECT_EQ(walk(uuid__nil, 3), (std::vector<uint16_t>{2001, 1003, 1002, 1001}));
-    // The same address again replaces its entry, which becomes the newest.
+    // The same address again, from the process that holds it, renews the
+    // entry in its place: a server renewing its registration doesn't push
+    // newer ones back.
     ASSERT_EQ(change(lb__register, entry_at(kHub, 1001)), rpc__s_ok);
-    EXPECT_EQ(walk(kHub), (std::vector<uint16_t>{1001, 1003, 1002}));
+    EXPECT_EQ(walk(kHub), (std::vector<uint16_t>{1003, 1002, 1001}));
     for (uint16_t port : {1001, 1002, 1003})
         EXPECT_EQ(change(lb__unregister, entry_at(kHub, port)), rpc__s_ok);
     EXPECT_EQ(change(lb__unregister, entry_at(kHub, 1001)), lb__s_not_registered);

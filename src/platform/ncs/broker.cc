@@ -118,7 +118,9 @@ std::string describe(const lb__entry_t &entry)
 class Database {
 public:
     // Adds `entry`, replacing one with the same key: rpc__s_ok or
-    // lb__s_database_full.
+    // lb__s_database_full. The connection that holds the entry already only
+    // renews it: the entry keeps its place among the others, so a server
+    // that registers again now and then doesn't push newer ones back.
     uint32_t add(const lb__entry_t &entry, uint64_t owner)
     {
         TRC1_FUNCTION();
@@ -133,8 +135,11 @@ public:
 
         std::lock_guard lock(mutex_);
         auto same = [&](const Record &r) { return same_key(r.entry, clean); };
-        auto old = std::find_if(records_.begin(), records_.end(), same);
-        const bool renewed = old != records_.end() && old->owner == owner;
+        auto held = std::find_if(records_.begin(), records_.end(), same);
+        if (held != records_.end() && held->owner == owner) {
+            held->entry = clean;
+            return rpc__s_ok;
+        }
         std::erase_if(records_, same);
         if (records_.size() >= kMaxEntries) {
             TRC1_ERROR_MSG("database full: %s refused", describe(clean).c_str());
@@ -143,10 +148,8 @@ public:
         if (next_serial_ > kMaxSerial)
             renumber();
         records_.push_back(Record{clean, next_serial_++, owner});
-        // A server that renews its own entry is no news.
-        if (!renewed)
-            TRC1_FLOW_MSG("registered %s (connection %llu)", describe(clean).c_str(),
-                          static_cast<unsigned long long>(owner));
+        TRC1_FLOW_MSG("registered %s (connection %llu)", describe(clean).c_str(),
+                      static_cast<unsigned long long>(owner));
         return rpc__s_ok;
     }
 

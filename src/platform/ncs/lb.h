@@ -48,7 +48,8 @@ NCS_API void lb__lookup_range(const uuid__t *object, const uuid__t *type, const 
 /* Registers `entry` with the broker of this host: the broker running in this
  * process, else the one at 127.0.0.1 and the broker port. An entry with the
  * same object, type, interface and address is replaced, and the entry becomes
- * the newest. An entry registered over the network lives as long as this
+ * the newest; registered again by the process that holds it, it is renewed
+ * in place and keeps its position. An entry registered over the network lives as long as this
  * process's connection to the broker, so the entries of a process that ends
  * go with it; a process made by fork has a connection of its own. Statuses:
  * lb__s_broker_unreachable, lb__s_database_full (the broker holds 1024
