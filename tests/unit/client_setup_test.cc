@@ -20,12 +20,8 @@ namespace {
 
 TEST(ClientSetup, TheStartReadsTheRetrySettingsFromTheEnvironment)
 {
-    // The same value goes into both variables.
-    const struct {
-        std::optional<std::string> value;
-        int32_t max_retry, interval;
-        const char *complaint;   // the traced line about DPX_MAX_RETRY, or null
-    } cases[] = {
+    // The same value goes into both variables; `complaint` is the traced line about DPX_MAX_RETRY, or null.
+    const struct { std::optional<std::string> value; int32_t max_retry, interval; const char *complaint; } cases[] = {
         {std::nullopt, 6, 3, "No DPX_MAX_RETRY env"},
         {"abc", 6, 3, "Bad DPX_MAX_RETRY env: abc"},
         {"", 6, 3, "Bad DPX_MAX_RETRY env: \n"},
@@ -38,14 +34,11 @@ TEST(ClientSetup, TheStartReadsTheRetrySettingsFromTheEnvironment)
         ScopedEnv max_retry("DPX_MAX_RETRY", c.value);
         ScopedEnv interval("DPX_MIN_RETRY_INTERVAL", c.value);
         TraceCapture trace(TRC1_FLOW);
-
         EXPECT_EQ(dpx_agent_init(), 0u);
         EXPECT_EQ(MAX_DPX_RETRY, c.max_retry);
         EXPECT_EQ(MIN_DPX_RETRY_INTERVAL, c.interval);
         EXPECT_EQ(trace.count("env"), c.complaint != nullptr ? 2u : 0u) << trace.text();
-        if (c.complaint != nullptr) {
-            EXPECT_TRUE(trace.contains(c.complaint)) << trace.text();
-        }
+        EXPECT_TRUE(c.complaint == nullptr || trace.contains(c.complaint)) << trace.text();
         EXPECT_TRUE(trace.contains("Set MAX_DPX_RETRY " + std::to_string(c.max_retry) + "\n"));
         EXPECT_TRUE(trace.contains("Set MIN_DPX_RETRY_INTERVAL " + std::to_string(c.interval) + " seconds\n"));
         EXPECT_EQ(dpx_agent_stop(), 0u);
@@ -69,11 +62,9 @@ TEST(ClientSetup, TheFrameworksHubNameComesFirstAndTheEnvironmentsIsRefusedWhenT
     // connection and leaves the attempt in HUB.
     ScopedEnv lb_port("NCS_LB_PORT", std::to_string(dpxtest::free_port()));
     const std::string too_long(100, 'h');
-    const struct {
-        std::optional<std::string> framework, environment;
-        dpx_status expected;
-        const char *hub;   // HUB afterwards; null: as before
-    } cases[] = {
+    // `hub` is HUB afterwards; null: as before.
+    const struct { std::optional<std::string> framework, environment; dpx_status expected; const char *hub; }
+        cases[] = {
         {std::nullopt, std::nullopt, DPX_E_NO_HUB_HOST, nullptr},
         {std::nullopt, too_long, DPX_E_NO_HUB_HOST, nullptr},
         {std::nullopt, "127.0.0.3", DPX_E_INVALID_PARAM, "127.0.0.3"},
@@ -89,7 +80,6 @@ TEST(ClientSetup, TheFrameworksHubNameComesFirstAndTheEnvironmentsIsRefusedWhenT
         std::strcpy(HUB, "before");
         handle_t handle = nullptr;
         dpx_status status = DPX_OK;
-
         get_hub_handle(&handle, &status);
         EXPECT_EQ(status, c.expected);
         EXPECT_EQ(handle, nullptr);
@@ -100,13 +90,9 @@ TEST(ClientSetup, TheFrameworksHubNameComesFirstAndTheEnvironmentsIsRefusedWhenT
 
 TEST(ClientSetup, AFileGetsBuffersSizedByItsWholeLength)
 {
-    const struct {
-        uint32_t chunks, remainder;
-        int16_t records;
-    } cases[] = {
-        {0, 0, 24}, {23, 4095, 24}, {24, 0, 24}, {24, 1, 25}, {30, 5, 31}, {128, 0, 128},
-        {128, 1, 128}, {256, 0, 128}, {0x7FFF, 0, 128}, {0x7FFF, 1, 24}, {0x8000, 0, 24},
-        {0xFFFE, 1, 24}, {0xFFFF, 0, 24}, {1u << 20, 5000 % 4096, 24},
+    const struct { uint32_t chunks, remainder; int16_t records; } cases[] = {
+        {0, 0, 24}, {23, 4095, 24}, {24, 0, 24}, {24, 1, 25}, {30, 5, 31}, {128, 0, 128}, {128, 1, 128},
+        {256, 0, 128}, {0x7FFF, 0, 128}, {0x7FFF, 1, 24}, {0x8000, 0, 24}, {0xFFFE, 1, 24}, {0xFFFF, 0, 24},
     };
     for (const auto &c : cases) {
         SCOPED_TRACE(testing::Message() << c.chunks << " chunks + " << c.remainder);

@@ -1,8 +1,6 @@
-// The RPC runtime: calls under one contract over both carriers (in-process,
-// and TCP to this process's server on 127.0.0.1); then binding handles,
-// registration, and the TCP carrier and server alone: repeats after cut
-// connections, idle connections, time-outs, stopping, hostile frames, and a
-// server in another process.
+// The RPC runtime over both carriers (in-process, TCP on 127.0.0.1): replies,
+// faults, binding handles, repeats after cut connections, idle connections,
+// stopping and hostile frames.
 #include "ncs/frame.h"
 #include "ncs/server.h"
 #include "ncs_echo.h"
@@ -11,8 +9,6 @@
 #include <gtest/gtest.h>
 
 #include <poll.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <random>
@@ -35,32 +31,6 @@ struct Server {
     uint16_t port() const { return ntohs(addr.in4.sin_port); }
     uint32_t status;
     socket__addr_t addr{};
-};
-
-// The same server in a child process, killed at the end of the scope.
-struct ChildServer {
-    ChildServer()
-    {
-        int ends[2] = {-1, -1};
-        pid = pipe(ends) == 0 ? fork() : -1;
-        if (pid == 0) {
-            Server server;
-            if (write(ends[1], &server.addr.in4.sin_port, 2) == 2)
-                pause();
-            _exit(1);
-        }
-        close(ends[1]);
-        EXPECT_EQ(read(ends[0], &port, 2), 2);
-        port = ntohs(port);
-        close(ends[0]);
-    }
-    ~ChildServer()
-    {
-        if (pid > 0 && kill(pid, SIGKILL) == 0)
-            waitpid(pid, nullptr, 0);
-    }
-    pid_t pid;
-    uint16_t port = 0;
 };
 
 socket__addr_t loopback(uint16_t port)
@@ -296,13 +266,6 @@ TEST(TcpIdle, CallAfterTheServerClosedAnIdleConnectionGoesOnANewOne)
     EXPECT_EQ(stats().accepted, before + 1);
 }
 
-TEST(TcpTimeOut, CallThatGetsNoAnswerEndsAtItsTimeOut)
-{
-    dpxtest::ScopedEnv timeout("NCS_CALL_TIMEOUT_MS", "200");
-    Server server;
-    EXPECT_EQ(call(Binding(server.port()).handle, kGate, "x").fault, rpc__s_timeout);
-}
-
 TEST_F(Tcp, CallUnderWayFinishesWhileItsInterfaceIsTakenAwayAndTheServerStops)
 {
     EXPECT_EQ(register_interface(), rpc__s_already_registered);
@@ -364,22 +327,6 @@ TEST_F(Tcp, MalformedTruncatedAndOversizedFramesCloseOnlyTheirOwnConnection)
     ASSERT_EQ(send(fd, good.data(), good.size(), 0), static_cast<ssize_t>(good.size()));
     EXPECT_EQ(receive(fd, ncs::frame::kHeaderSize + 4).substr(ncs::frame::kHeaderSize), word_body(1));
     close(fd);
-}
-
-TEST(TcpTwoProcesses, ServerKilledMidCallGivesACommunicationStatusAndARestartedOneIsReached)
-{
-    Outcome out;
-    {
-        ChildServer server;
-        Binding h(server.port);
-        std::thread caller([&] { out = call(h.handle, kGate, "cut", RPC_OPT_AT_MOST_ONCE); });
-        std::this_thread::sleep_for(std::chrono::milliseconds(300));
-        kill(server.pid, SIGKILL);
-        caller.join();
-    }
-    EXPECT_TRUE(out.fault == rpc__s_comm_failure || out.fault == rpc__s_connection_reset) << std::hex << out.fault;
-    ChildServer restarted;
-    EXPECT_EQ(call(Binding(restarted.port).handle, kEcho, "back").body, "back");
 }
 
 }  // namespace

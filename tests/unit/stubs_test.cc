@@ -1,7 +1,5 @@
-// The interface dpx_transfer version 1 and its stubs: the bytes of the eight
-// bodies in every representation, round trips through the in-process
-// carrier, the bound faults, truncated requests, the sorting of faults, and
-// the one-time setup of the stubs.
+// The interface dpx_transfer version 1 and its stubs: bodies in every
+// representation, round trips, bound faults, fault sorting, one-time setup.
 #include "dpxagt.h"
 #include "foreign_body.h"
 
@@ -22,9 +20,7 @@ using namespace dpxtest;
 namespace {
 
 std::atomic<int> g_fills{0};
-// What the calls of this thread sent: the last request's body, its options
-// word and its reply's length. A call runs on its caller's thread, manager
-// included.
+// What this thread's last call sent: body, options word, reply length.
 thread_local std::vector<unsigned char> g_request;
 thread_local uint32_t g_options = 0, g_reply_len = 0;
 // When set, the reply of a peer of another kind instead of a call.
@@ -33,11 +29,9 @@ thread_local std::optional<std::pair<std::vector<unsigned char>, Rep>> g_foreign
 }  // namespace
 
 // The stubs resolve NRTR1_InitData and rpc__sar to these stand-ins, which
-// record what passes and hand on to the runtime's own. The first takes its
-// time, so that threads arriving meanwhile would fill a record again, or
-// read it half filled, if the stubs' gate let them. The second can hand
-// back a foreign reply as a network carrier would: in a packet, with the
-// sender's drep.
+// record what passes and hand on to the runtime's own. The first is slow, so
+// racing threads would see a half-filled record if the stubs' gate let them;
+// the second can hand back a foreign reply in a packet with its drep.
 extern "C" void NRTR1_InitData(void *data)
 {
     static const auto runtime = reinterpret_cast<void (*)(void *)>(dlsym(RTLD_NEXT, "NRTR1_InitData"));
@@ -69,8 +63,7 @@ extern "C" void rpc__sar(handle_t handle, uint32_t options, const rpc__if_spec_t
 
 namespace {
 
-// ---- The service: managers that record their arguments and answer as the
-// test scripts them ---------------------------------------------------------
+// Managers that record their arguments and answer as the test scripts them.
 
 struct Script {
     int calls = 0;
@@ -80,9 +73,7 @@ struct Script {
 };
 thread_local Script g_script;
 
-// Runs the script on the arguments in `m` and returns them as answered;
-// the answer's elements go back into the manager's `array` as far as it
-// holds them.
+// Runs the script on `m`; the answer's elements go into `array` as far as it holds them.
 Message run_script(Message m, void *array = nullptr)
 {
     ++g_script.calls;
@@ -135,9 +126,8 @@ void list_manager(handle_t, dpx_node_filter filter, int16_t *last, int16_t max, 
 
 const dpx_transfer_v1_epv_t kTestManagers = {get_manager, put_manager, query_manager, list_manager};
 
-// A handle to the library's server stubs with the test managers, registered
-// on this process's server once and reached through the in-process carrier.
-// Each test starts with a fresh script and record.
+// A handle to the server stubs with the test managers over the in-process
+// carrier; each test starts with a fresh script and record.
 handle_t peer()
 {
     static const handle_t handle = [] {
@@ -154,12 +144,10 @@ handle_t peer()
     return handle;
 }
 
-// Calls the server stub of `opnum` directly with a request written in `rep`,
-// offering 992 bytes for the reply. Returns the reply body.
+// Calls the server stub of `opnum` with a request written in `rep`; the reply body.
 std::vector<unsigned char> call_server_stub(uint32_t opnum, const std::vector<unsigned char> &request, Rep rep)
 {
-    // An odd data_offs: a body's alignment must not depend on it. Both
-    // buffers end exactly where the stub may use them.
+    // An odd data_offs (alignment must not depend on it); buffers end where the stub may use them.
     constexpr uint16_t kDataOffs = 7, kOutMax = 992;
     rpc__handle_rec handle{kDataOffs};
     std::vector<unsigned char> in(kDataOffs + request.size()), out(kDataOffs + kOutMax);
@@ -186,8 +174,7 @@ Message sized(Message m)
     return m;
 }
 
-// Calls the client stub of `opnum` through `handle` with the caller's
-// arguments in `m`, its arrays made max + 1 long.
+// Calls the client stub of `opnum` with the arguments in `m`, arrays max + 1 long.
 void client_call(uint32_t opnum, Message &m, handle_t handle)
 {
     m = sized(m);
@@ -217,8 +204,7 @@ uint32_t raised_status(const std::function<void()> &call)
     return 0;
 }
 
-// One call of each operation: the request, with the caller's array of
-// elements 0 .. last, and how the manager answers it.
+// One call of each operation and how the manager answers it.
 struct Case {
     uint32_t opnum;
     const Layout &request_layout, &reply_layout;
@@ -254,14 +240,12 @@ std::vector<Case> cases()
     };
 }
 
-// ---- Interface and bodies ---------------------------------------------------
-
 TEST(Interface, TheInterfaceRecordHoldsTheIdentityAndTheLocatorsFindTheVectors)
 {
     static_assert(sizeof dpx_transfer_v1_if_spec == 88);
     const rpc__if_spec_t &spec = dpx_transfer_v1_if_spec;
     EXPECT_EQ(std::make_tuple(spec.vers, spec.opcnt, spec.gap), std::make_tuple(1u, uint16_t{4}, uint16_t{0}));
-    EXPECT_EQ(std::count(std::begin(spec.port), std::end(spec.port), 0), 32) << "no well-known port";
+    EXPECT_EQ(std::count(std::begin(spec.port), std::end(spec.port), 0), 32);
     char text[37];
     uuid__encode(&spec.id, text);
     EXPECT_STREQ(text, "c00947ae0000.22.04.00.00.00.c0.a8.00");
@@ -269,15 +253,10 @@ TEST(Interface, TheInterfaceRecordHoldsTheIdentityAndTheLocatorsFindTheVectors)
     EXPECT_EQ(dpx_transfer_v1_server_epv_locator(), dpx_transfer_v1_server_epva);
 }
 
-// Every operation, from senders of this machine's representation, of
-// another byte order and character set, of either alone, and of another
-// float format alone. Integers are reversed, texts translated, data, state
-// and reserved taken as they came: the manager and the caller get what the
-// sender meant. A request cut short at any length is refused without
-// calling the manager (tried in the first two representations, which take
-// every path of the reader). Every body this machine writes is byte for
-// byte the table's, gaps zero. In this machine's representation the call
-// goes the whole way: client stub, carrier, server stub, manager and back.
+// Every operation from senders of every representation: integers reversed,
+// texts translated, data taken as it came. A request cut short at any length
+// is refused without calling the manager. Bodies written here are byte for
+// byte the table's; locally the call goes client stub to manager and back.
 TEST(Wire, BodiesAreWrittenByTheTablesAndReadAsTheirSenderMeantThem)
 {
     const handle_t handle = peer();
@@ -327,8 +306,6 @@ TEST(Wire, BodiesInUseHaveTheLengthsOfTheSizesTable)
     }
 }
 
-// ---- Calls ------------------------------------------------------------------
-
 TEST(Stubs, AClientStubRefusesALastOutsideMinusOneToMaxAndSendsNothing)
 {
     const handle_t handle = peer();
@@ -346,8 +323,6 @@ TEST(Stubs, AClientStubRefusesALastOutsideMinusOneToMaxAndSendsNothing)
     EXPECT_TRUE(g_request.empty()) << "nothing is sent";
 }
 
-// The manager relies on max + 1 elements, and on last + 1 that came: a
-// request whose words say otherwise is refused before the manager runs.
 TEST(Stubs, ServerStubsRefuseArraysWhoseWordsDisagreeWithMaxAndLastBeforeTheManagerRuns)
 {
     // last, max, size word and count word (when not max + 1 and last + 1), accepted
@@ -380,8 +355,7 @@ TEST(Stubs, ServerStubsRefuseArraysWhoseWordsDisagreeWithMaxAndLastBeforeTheMana
     }
 }
 
-// The fields in front of the array are delivered; `last` and the array stay
-// as they were. The client stub raises the fault on.
+// The fields in front of the array are delivered; `last` and the array stay.
 TEST(Stubs, AClientStubRefusesAReplyCountAboveMaxOrOtherThanLastPlusOneAndKeepsLastAndArray)
 {
     const handle_t handle = peer();
@@ -401,11 +375,8 @@ TEST(Stubs, AClientStubRefusesAReplyCountAboveMaxOrOtherThanLastPlusOneAndKeepsL
     EXPECT_EQ(args.last, 1);
 }
 
-// A fault on the service side, raised or the server stub's refusal of the
-// `last` that the manager left, comes back through the carrier as a raise
-// in the client stub, which sorts it. The caller's arguments stay as they
-// were, and every packet and array on the way is given back once (the
-// suite runs under AddressSanitizer too).
+// A service-side fault (raised, or the refusal of the manager's `last`) is
+// sorted by the client stub; arguments stay, and every packet is freed once.
 TEST(Stubs, ACommunicationFailureReturnsInStatusAndAnyOtherFaultIsRaisedOnWithTheArgumentsAsTheyWere)
 {
     const handle_t handle = peer();
@@ -430,13 +401,8 @@ TEST(Stubs, ACommunicationFailureReturnsInStatusAndAnyOtherFaultIsRaisedOnWithTh
     }
 }
 
-// ---- One-time setup -----------------------------------------------------------
-
-// Runs in a fresh process: the first calls of both stub groups come from
-// many threads at once. The two records are filled once each, and no stub
-// reads its record before it is complete (an unfilled record says
-// big-endian, which would garble every answer on this machine; a group
-// filled twice leaves the other unfilled or the count above two).
+// In a fresh process, first calls of both stub groups from many threads: each
+// record is filled once, and none is read half filled (that garbles answers).
 TEST(StubSetup, FirstCallsFromManyThreadsFillEachStubGroupsRecordOnce)
 {
     GTEST_FLAG_SET(death_test_style, "threadsafe");

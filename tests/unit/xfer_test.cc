@@ -1,6 +1,6 @@
 // Reading a file into transfer buffers and writing buffers back, and the
-// identity of a file across the calls of a transfer, on real files, sparse
-// ones of more than 4 GiB included.
+// identity of a file across the calls of a transfer, on real files (reads
+// beyond 4 GiB go through the read service's sparse-file test).
 #include "cx_test_file.h"
 #include "test_support.h"
 #include "trc/trc1.h"
@@ -82,31 +82,6 @@ TEST(XferRead, AFailedSeekOrReadLeavesTheOutArgumentsAsTheyWere)
         EXPECT_EQ(status, c.status);
         EXPECT_EQ(trace.count(c.trace), 1u) << trace.text();
     }
-}
-
-TEST(XferRead, ChunksOnBothSidesOfTheTwoAndFourGiBBoundariesComeFromTheirPlace)
-{
-    TempDir tmp;
-    const uint32_t below_2g = (1u << 19) - 1, below_4g = (1u << 20) - 1;
-    make_file(tmp / "sparse", (uint64_t{below_4g} + 3) * 4096 + 100, 0, 0);
-    const int fd = open((tmp / "sparse").c_str(), O_WRONLY);
-    for (uint32_t chunk : {below_2g, below_2g + 1, below_4g, below_4g + 1, below_4g + 3}) {
-        const std::string mark = std::to_string(chunk);
-        EXPECT_EQ(pwrite(fd, mark.data(), mark.size(), off_t{chunk} * 4096), ssize_t(mark.size()));
-    }
-    close(fd);
-    CxFile file;
-    ASSERT_TRUE(cx_ok(file.open(tmp / "sparse", CX_FILE_READ)));
-    std::vector<dpx_chunk> buffer(2);
-    // The zeros of the sparse file end each mark.
-    const auto mark = [&buffer](int i) { return std::string(reinterpret_cast<const char *>(buffer[i].data)); };
-    dpx_status status = DPX_E_QUIET;
-    for (uint32_t first : {below_2g, below_4g}) {
-        EXPECT_EQ(read_call(file, first, buffer, 1, &status), Call(1, 0, first + 2));
-        EXPECT_TRUE(mark(0) == std::to_string(first) && mark(1) == std::to_string(first + 1)) << first;
-    }
-    EXPECT_EQ(read_call(file, below_4g + 3, buffer, 1, &status), Call(0, 1, below_4g + 4));
-    EXPECT_TRUE(mark(0) == std::to_string(below_4g + 3) && buffer[0].length == 100);
 }
 
 TEST(XferWrite, WritesRecordsZeroToLastInOrderOrNothingWhenOneClaimsMoreThanAChunk)
