@@ -129,8 +129,7 @@ private:
 class Server {
 public:
     Server(uint32_t threads, uint32_t max_connections, std::chrono::seconds idle_timeout)
-        : thread_count_(threads), max_connections_(max_connections), idle_timeout_(idle_timeout),
-          contexts_(make_contexts(threads))
+        : max_connections_(max_connections), idle_timeout_(idle_timeout), contexts_(make_contexts(threads))
     {
     }
     Server(const Server &) = delete;
@@ -276,7 +275,6 @@ private:
         }
     }
 
-    const uint32_t thread_count_;
     const uint32_t max_connections_;
     const std::chrono::seconds idle_timeout_;
 
