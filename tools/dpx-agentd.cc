@@ -162,7 +162,7 @@ int main(int argc, char **argv)
     if (!options.advertise_host.empty() && !options.hub)
         return usage_error("--advertise goes with --hub");
 
-    // The signals are taken by sigwait below; every thread inherits the mask.
+    // The signals are taken by the wait below; every thread inherits the mask.
     sigset_t stop_signals;
     sigemptyset(&stop_signals);
     sigaddset(&stop_signals, SIGTERM);
@@ -230,8 +230,8 @@ int main(int argc, char **argv)
                  options.product.c_str(), options.threads, options.hub ? ", hub" : "",
                  options.broker ? ", broker" : "");
 
-    // Registering again replaces the entry at a broker that has it and makes
-    // it anew at one that was restarted. The embedded broker goes and comes
+    // Registering again renews the entry, in its place, at a broker that has
+    // it, and makes it anew at one that was restarted. The embedded broker goes and comes
     // with this process: nothing to renew.
     const bool renew = options.hub && !options.broker && options.renew_s > 0;
     int signal_number = -1;
