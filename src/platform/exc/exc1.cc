@@ -14,6 +14,8 @@ EXC1_CONTEXT *EXC1_Thread(void)
 void EXC1__Raise(EXC1_CONTEXT *context, uint32_t status)
 {
     EXC1_CONTEXT *own = context != nullptr ? context : &t_context;
+    if (status == EXC1_FRAME_SET)
+        status = EXC1_S_FRAME_SET_RAISED;
     own->status = status;
     own->handling = 1;
     throw exc::Fault{status};

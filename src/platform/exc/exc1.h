@@ -23,6 +23,10 @@ extern "C" {
  * to its end without a raise. */
 #define EXC1_FRAME_SET 0x03040003u
 
+/* What a raise of EXC1_FRAME_SET carries instead: a raise must never read as
+ * a body that ran to its end. */
+#define EXC1_S_FRAME_SET_RAISED 0x030400FFu
+
 typedef struct EXC1_CONTEXT EXC1_CONTEXT;
 
 typedef struct EXC1_FRAME {
@@ -42,8 +46,8 @@ struct EXC1_CONTEXT {
 /* The calling thread's context. Never null. */
 EXC1_API EXC1_CONTEXT *EXC1_Thread(void);
 
-/* Raises `status` on the thread of `context` (the calling thread's). Does
- * not return. REQUIRES: a frame is armed on the calling thread, or the caller
+/* Raises `status` on the thread of `context` (the calling thread's);
+ * EXC1_FRAME_SET is raised as EXC1_S_FRAME_SET_RAISED. Does not return. REQUIRES: a frame is armed on the calling thread, or the caller
  * is prepared to catch exc::Fault itself. */
 EXC1_API __attribute__((noreturn)) void EXC1__Raise(EXC1_CONTEXT *context, uint32_t status);
 

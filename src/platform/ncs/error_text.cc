@@ -35,6 +35,7 @@ constexpr StatusText kTexts[] = {
     {rpc__s_fault_invalid_bound, "array bound out of range"},
     {rpc__s_no_memory, "out of memory in the RPC runtime"},
     {rpc__s_fault_unspec, "unspecified fault in the remote procedure"},
+    {EXC1_S_FRAME_SET_RAISED, "a fault raised with the value that means no fault"},
     // Registration.
     {rpc__s_already_registered, "interface already registered"},
     {rpc__s_not_registered, "interface not registered"},

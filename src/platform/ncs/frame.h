@@ -119,8 +119,11 @@ inline void encode(const Header &h, Bytes out)
 }
 
 // Reads a header. False for a frame this format can't take: another magic
-// or version, an unknown kind, a fault with a body. A body length above
-// RPC_MAX_BODY is left to the reader, who refuses it with rpc__s_too_big.
+// or version, an unknown kind, a fault with a body, or a fault whose status
+// is no failure: 0, or the value that exception frames return when no raise
+// arrived, which a stub would take for a call that ran to its end. A body
+// length above RPC_MAX_BODY is left to the reader, who refuses it with
+// rpc__s_too_big.
 inline bool decode(const Bytes in, Header &h)
 {
     if (get32(in + kMagicOffset) != kMagic || get16(in + kVersionOffset) != kVersion)
@@ -140,8 +143,7 @@ inline bool decode(const Bytes in, Header &h)
     h.opnum = get32(in + kOpnumOffset);
     h.body_len = get32(in + kBodyLenOffset);
     h.fault = get32(in + kFaultOffset);
-    // A fault has no body.
-    return h.kind != kFault || h.body_len == 0;
+    return h.kind != kFault || (h.body_len == 0 && h.fault != rpc__s_ok && h.fault != EXC1_FRAME_SET);
 }
 
 }  // namespace ncs::frame
