@@ -76,6 +76,7 @@ public:
     std::string reason;  // empty when the hosts are ready
     const std::string tag = std::to_string(getpid() % 100000), hub = "dpxh" + tag, client = "dpxc" + tag;
     const std::string subnet = "10.200." + std::to_string(getpid() % 250) + ".", hub_address = subnet + "1";
+    const std::string client_address = subnet + "2";
     const std::string hub_link = "vh" + tag, client_link = "vc" + tag;
 
 private:
@@ -155,6 +156,38 @@ TEST(TwoHosts, AFileCrossesALossySlowLinkWholeAndACutLinkFailsTheTransferCleanly
     EXPECT_TRUE(files_with_prefix(dir / "tmp", "cxp").empty());
 
     delay.signal(SIGKILL);
+    daemon.signal(SIGTERM);
+    EXPECT_TRUE(exited_with(daemon.wait(), 0));
+}
+
+// A broker reachable from another host takes lookups from there, but no
+// registration: a stranger can't point the host's clients elsewhere.
+TEST(TwoHosts, TheBrokerRefusesRegistrationsFromAnotherHostAndStillAnswersItsLookups)
+{
+    TwoHosts hosts;
+    if (!hosts.reason.empty())
+        GTEST_SKIP() << hosts.reason;
+    TempDir dir;
+    made_dir(dir / "depot/prod");
+    Process daemon(hosts.in(hosts.hub, {bin_dir() + "/dpx-agentd", "--depot", dir / "depot", "--product", "prod",
+                                        "--listen", hosts.hub_address + ":0", "--hub", "--broker"}),
+                   {{"NCS_LB_PORT", std::to_string(kBrokerPort)}, {"TRC1_FLAGS", "0x80"},
+                    {"TRC1_FILE", dir / "trace"}});
+    uint16_t port = listening_port(daemon);
+    ASSERT_NE(port, 0);
+    const std::vector<std::string> tries = {bin_dir() + "/dpx_test_register", hosts.hub_address};
+    const std::string hub = hosts.hub_address + ":" + std::to_string(port);
+    Ran stranger = run(hosts.in(hosts.client, tries), {{"NCS_LB_PORT", std::to_string(kBrokerPort)}});
+    ASSERT_EQ(stranger.out.size(), 2u) << stranger.err;
+    EXPECT_EQ(stranger.out[0], "register 0x1C030005");
+    EXPECT_EQ(stranger.out[1], "lookup 0x00000000 1 " + hub);
+    EXPECT_NE(read_file(dir / "trace").find("registration from " + hosts.client_address + " refused"),
+              std::string::npos);
+    // The same message from the broker's own host is taken (and goes with
+    // its connection, before the lookup).
+    Ran own = run(hosts.in(hosts.hub, tries), {{"NCS_LB_PORT", std::to_string(kBrokerPort)}});
+    ASSERT_EQ(own.out.size(), 2u) << own.err;
+    EXPECT_EQ(own.out[0], "register 0x00000000");
     daemon.signal(SIGTERM);
     EXPECT_TRUE(exited_with(daemon.wait(), 0));
 }

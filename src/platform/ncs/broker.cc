@@ -7,6 +7,7 @@
 #include "trc/trc1.h"
 
 #include <asio.hpp>
+#include <ifaddrs.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -226,6 +227,33 @@ private:
 
 // ---- The service -------------------------------------------------------------
 
+// True when `peer` is an address of this host: loopback, or an address of
+// one of its interfaces (an IPv4 address mapped into IPv6 counts as itself).
+bool own_host_address(asio::ip::address peer)
+{
+    if (peer.is_v6() && peer.to_v6().is_v4_mapped())
+        peer = asio::ip::make_address_v4(asio::ip::v4_mapped, peer.to_v6());
+    if (peer.is_loopback())
+        return true;
+    ifaddrs *list = nullptr;
+    if (getifaddrs(&list) != 0)
+        return false;
+    bool own = false;
+    for (const ifaddrs *i = list; i != nullptr && !own; i = i->ifa_next) {
+        if (i->ifa_addr == nullptr)
+            continue;
+        if (i->ifa_addr->sa_family == AF_INET && peer.is_v4()) {
+            const auto *in = reinterpret_cast<const sockaddr_in *>(i->ifa_addr);
+            own = ntohl(in->sin_addr.s_addr) == peer.to_v4().to_uint();
+        } else if (i->ifa_addr->sa_family == AF_INET6 && peer.is_v6()) {
+            const auto *in6 = reinterpret_cast<const sockaddr_in6 *>(i->ifa_addr);
+            own = std::memcmp(in6->sin6_addr.s6_addr, peer.to_v6().to_bytes().data(), 16) == 0;
+        }
+    }
+    freeifaddrs(list);
+    return own;
+}
+
 class Broker;
 
 // One connection to the broker. It reads a request, answers it, and reads the
@@ -244,9 +272,15 @@ private:
     void on_header();
     void on_body();
 
+    // Registrations and removals: only from this host, whose processes are
+    // the only ones that may name where this host's servers listen.
+    uint32_t update(const lb__entry_t &entry);
+
     Broker &broker_;
     tcp::socket socket_;
     uint64_t owner_;
+    std::string peer_;  // the peer's address, for traces
+    bool own_host_;     // the peer is a process of this host
     wire::Kind kind_ = wire::Kind::kReply;
     std::array<uint8_t, wire::kHeaderSize> header_{};
     std::array<uint8_t, wire::kMaxRequestBody> body_{};
@@ -299,8 +333,14 @@ private:
 };
 
 Session::Session(Broker &broker, tcp::socket socket, uint64_t owner)
-    : broker_(broker), socket_(std::move(socket)), owner_(owner)
+    : broker_(broker), socket_(std::move(socket)), owner_(owner), own_host_(false)
 {
+    asio::error_code ec;
+    tcp::endpoint peer = socket_.remote_endpoint(ec);
+    if (!ec) {
+        peer_ = peer.address().to_string();
+        own_host_ = own_host_address(peer.address());
+    }
 }
 
 Session::~Session()
@@ -343,12 +383,7 @@ void Session::on_body()
         head = broker_.database().lookup(wire::get_query(reader), found);
     } else {
         lb__entry_t entry{};
-        if (!wire::get_entry(reader, entry))
-            head.status = lb__s_bad_argument;
-        else if (kind_ == wire::Kind::kRegister)
-            head.status = broker_.database().add(entry, owner_);
-        else
-            head.status = broker_.database().remove(entry);
+        head.status = wire::get_entry(reader, entry) ? update(entry) : lb__s_bad_argument;
     }
     uint32_t body_len = static_cast<uint32_t>(wire::kReplyFixedSize + found.size() * wire::kEntrySize);
     reply_.resize(wire::kHeaderSize + body_len);
@@ -361,6 +396,18 @@ void Session::on_body()
         if (!ec)
             self->read_header();
     });
+}
+
+uint32_t Session::update(const lb__entry_t &entry)
+{
+    TRC1_FUNCTION();
+    const bool registering = kind_ == wire::Kind::kRegister;
+    if (!own_host_) {
+        TRC1_ERROR_MSG("%s from %s refused: not this host", registering ? "registration" : "removal",
+                       peer_.empty() ? "an unknown peer" : peer_.c_str());
+        return lb__s_not_permitted;
+    }
+    return registering ? broker_.database().add(entry, owner_) : broker_.database().remove(entry);
 }
 
 std::unique_ptr<Broker> Broker::start(const tcp::endpoint &endpoint, uint32_t &status)

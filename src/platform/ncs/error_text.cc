@@ -44,6 +44,7 @@ constexpr StatusText kTexts[] = {
     {lb__s_broker_unreachable, "location broker unreachable"},
     {lb__s_database_full, "location broker database full"},
     {lb__s_bad_argument, "entry or argument not accepted by the location broker"},
+    {lb__s_not_permitted, "the location broker takes registrations from its own host only"},
     // Sockets and UUIDs.
     {socket__s_bad_family, "address family not supported"},
     {socket__s_name_too_long, "name too long for its buffer"},

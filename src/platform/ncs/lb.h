@@ -54,6 +54,9 @@ NCS_API void lb__lookup_range(const uuid__t *object, const uuid__t *type, const 
  * go with it; a process made by fork has a connection of its own. Statuses:
  * lb__s_broker_unreachable, lb__s_database_full (the broker holds 1024
  * entries at most), lb__s_bad_argument (null, or `saddr_len` above 104).
+ * A broker takes registrations and removals only from its own host (a
+ * connection from a loopback address or one of the host's interfaces) and
+ * answers any other with lb__s_not_permitted; lookups are open to all.
  * lb__unregister removes the entry with the same object, type, interface
  * and address (lb__s_not_registered when there is none). */
 NCS_API void lb__register(const lb__entry_t *entry, uint32_t *status);

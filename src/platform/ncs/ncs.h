@@ -53,6 +53,7 @@ extern "C" {
 #define lb__s_broker_unreachable  0x1C030002u
 #define lb__s_database_full       0x1C030003u
 #define lb__s_bad_argument        0x1C030004u /* an entry or argument the broker can't take */
+#define lb__s_not_permitted       0x1C030005u /* a registration or removal from another host */
 /* Sockets and UUIDs. */
 #define socket__s_bad_family      0x1C040001u
 #define socket__s_name_too_long   0x1C040002u /* the text doesn't fit the room given */
