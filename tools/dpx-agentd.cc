@@ -6,12 +6,15 @@
 #include "ncs/lb.h"
 #include "ncs/server.h"
 
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <future>
 #include <pthread.h>
 #include <string>
+#include <thread>
 
 namespace {
 
@@ -24,7 +27,8 @@ const char kUsage[] =
     "  --depot DIR         depot root (sets DPX_DEPOTROOT for the library)\n"
     "  --product NAME      product name; files are served below DIR/NAME\n"
     "  --listen HOST:PORT  address to listen on (default 127.0.0.1 and a free port)\n"
-    "  --threads N         threads that run calls, 1 to 64 (default 8)\n"
+    "  --threads N         calls run at once, 1 to 64 (default 32); a call that finds them\n"
+    "                      all busy is answered busy (0xF11E0014) and the client retries\n"
     "  --hub               register this server in the host's location broker as the hub,\n"
     "                      so that clients whose hub is this host find it\n"
     "  --advertise HOST:PORT  the address registered with --hub, when clients reach this\n"
@@ -42,12 +46,18 @@ const char kUsage[] =
     "\n"
     "When ready it prints one line \"listening on HOST:PORT\" on standard output.\n"
     "It logs to standard error. SIGTERM or SIGINT stop it: calls under way finish,\n"
-    "and it exits 0. It exits 1 when it can't listen, 2 on a usage error.\n"
+    "and it exits 0; calls still blocked after 5 seconds (a file whose open never\n"
+    "returns) are abandoned, their connections closed with no reply. It exits 1\n"
+    "when it can't listen, 2 on a usage error.\n"
     "\n"
     "Environment:\n"
     "  NCS_LB_PORT             port of the location broker (default 135)\n"
     "  NCS_MAX_CONNECTIONS     connections served at once (default 256)\n"
+    "  NCS_MAX_CONNECTIONS_PER_PEER  connections from one address (default 64)\n"
     "  NCS_IDLE_TIMEOUT_S      idle connections are closed after this (default 300)\n"
+    "  NCS_FRAME_TIMEOUT_S     a request must arrive whole this long after its first\n"
+    "                          byte (default 30)\n"
+    "  NCS_MAX_PENDING_BODY_MB request bodies still arriving, all together (default 64)\n"
     "  NCS_CALL_TIMEOUT_MS     time-out of one call on a connection (default 120000)\n"
     "  DPX_MAX_RETRY           tries of a call on a busy peer (default 6)\n"
     "  DPX_MIN_RETRY_INTERVAL  first sleep in seconds after a busy answer (default 3)\n"
@@ -61,12 +71,37 @@ struct Options {
     uint32_t port = 0;
     std::string advertise_host;  // empty: register the address listened on
     uint32_t advertise_port = 0;
-    uint32_t threads = 8;
+    uint32_t threads = 32;
     uint32_t renew_s = 10;
     bool hub = false;
     bool broker = false;
     bool confine = false;
 };
+
+// The managers that answer while every thread that runs calls is busy: busy,
+// and nothing else touched, so the client's retry sends the same call again.
+void busy_get_chunks(handle_t, dpx_file_desc *, uint32_t *, uint8_t *, uint32_t *, int16_t *, int16_t,
+                     dpx_status *status, dpx_chunk *)
+{
+    *status = DPX_E_BUSY;
+}
+void busy_put_chunks(handle_t, dpx_file_desc, uint32_t, uint8_t, int16_t *, int16_t, dpx_status *status,
+                     dpx_chunk *)
+{
+    *status = DPX_E_BUSY;
+}
+void busy_agent_query(handle_t, dpx_query_text, dpx_file_desc, uint32_t *, dpx_status *status)
+{
+    *status = DPX_E_BUSY;
+}
+void busy_list_nodes(handle_t, dpx_node_filter, int16_t *, int16_t, dpx_status *status, dpx_node_name *)
+{
+    *status = DPX_E_BUSY;
+}
+const dpx_transfer_v1_epv_t kBusyManagers = {busy_get_chunks, busy_put_chunks, busy_agent_query, busy_list_nodes};
+
+// How long a stop waits for calls under way before the process ends without them.
+constexpr auto kStopGrace = std::chrono::seconds(5);
 
 int usage_error(const char *message)
 {
@@ -204,6 +239,7 @@ int main(int argc, char **argv)
         return 1;
     }
     dpx_agent_init();
+    rpc__register_busy_mgr(&dpx_transfer_v1_if_spec, &kBusyManagers, &status);
 
     lb__entry_t entry;
     std::memset(&entry, 0, sizeof entry);
@@ -260,8 +296,21 @@ int main(int argc, char **argv)
     // then the calls under way run to their end before the library stops.
     if (options.hub)
         lb__unregister(&entry, &status);
-    rpc__stop_listening();
-    dpx_agent_stop();
+    // A call whose manager never returns (a FIFO's open) would hold the stop
+    // for ever: past the grace, the process ends and the kernel closes the
+    // connections of such calls.
+    std::packaged_task<void()> stopping([] {
+        rpc__stop_listening();
+        dpx_agent_stop();
+    });
+    std::future<void> stopped = stopping.get_future();
+    std::thread(std::move(stopping)).detach();
+    if (stopped.wait_for(kStopGrace) != std::future_status::ready) {
+        std::fprintf(stderr, "dpx-agentd: calls still blocked after %lld s, abandoned\n",
+                     static_cast<long long>(kStopGrace.count()));
+        std::fflush(stderr);
+        std::_Exit(0);
+    }
     if (options.broker)
         lb__stop_broker();
     std::fprintf(stderr, "dpx-agentd: stopped\n");

@@ -67,7 +67,7 @@ private:
 
 TEST(Limits, EachRefusedRequestEndsOnItsOwnAndTheDaemonServesOn)
 {
-    ScopedEnv idle("NCS_IDLE_TIMEOUT_S", "1"), connections("NCS_MAX_CONNECTIONS", "4");
+    ScopedEnv frame_time("NCS_FRAME_TIMEOUT_S", "1"), connections("NCS_MAX_CONNECTIONS", "4");
     Hub hub;
     {
         SCOPED_TRACE("a body above the limit");
@@ -77,7 +77,7 @@ TEST(Limits, EachRefusedRequestEndsOnItsOwnAndTheDaemonServesOn)
         EXPECT_TRUE(peer.closed());
     }
     {
-        SCOPED_TRACE("a frame whose body never comes, closed at the idle time-out");
+        SCOPED_TRACE("a frame whose body never comes, closed at the frame time-out");
         RawPeer peer(hub.port);
         peer.send_request(DPX_OP_PUT_CHUNKS, std::vector<unsigned char>(1000, 0), RPC_MAX_BODY);
         EXPECT_TRUE(peer.closed());
@@ -99,8 +99,8 @@ TEST(Limits, EachRefusedRequestEndsOnItsOwnAndTheDaemonServesOn)
     }
     EXPECT_TRUE(eventually([&] { return resources_of(daemon).sockets <= at_rest; }));
 
-    // Bodies refused on one connection, one after the other: a fault, or a
-    // reply with a status.
+    // Refused bodies: a fault, which closes its connection, or a reply with a
+    // status, after which the connection serves on.
     auto request = [](uint16_t max, int16_t last, std::vector<dpx_chunk> chunks) {
         Message m;
         m.desc = sample_desc("limits/" + std::to_string(max) + "-" + std::to_string(last));
@@ -127,15 +127,19 @@ TEST(Limits, EachRefusedRequestEndsOnItsOwnAndTheDaemonServesOn)
         {"a path field without NUL", DPX_OP_PUT_CHUNKS, no_nul, 0, DPX_E_INVALID_PARAM},
         {"a record longer than a chunk", DPX_OP_PUT_CHUNKS, too_long, 0, DPX_E_INVALID_PARAM},
     };
-    RawPeer peer(hub.port);
+    auto peer = std::make_unique<RawPeer>(hub.port);
     for (const auto &r : refused) {
         SCOPED_TRACE(r.what);
         bool get = r.opnum == DPX_OP_GET_CHUNKS;
         std::vector<unsigned char> body = encode(get ? kGetChunksRequest : kPutChunksRequest, r.message, local_rep());
-        peer.send_request(r.opnum, body, body.size());
-        auto [header, reply] = peer.answer();
+        peer->send_request(r.opnum, body, body.size());
+        auto [header, reply] = peer->answer();
         ASSERT_EQ(header.kind, r.fault != 0 ? frame::kFault : frame::kReply);
         EXPECT_EQ(header.fault, r.fault);
+        if (r.fault != 0) {
+            EXPECT_TRUE(peer->closed());
+            peer = std::make_unique<RawPeer>(hub.port);
+        }
         Message answer = r.fault == 0 ? decode(get ? kGetChunksReply : kPutChunksReply, reply, local_rep()) : Message{};
         EXPECT_EQ(answer.status, r.status);
     }

@@ -234,6 +234,13 @@ typedef void (*rpc__server_stub_t)(handle_t handle, void *in_pkt, uint32_t in_le
  * under way then. `type` is not used: one manager table serves all objects. */
 NCS_API void rpc__register_mgr(const uuid__t *type, const rpc__if_spec_t *ifspec,
                                const rpc__server_stub_t *server_epv, const void *mgr_epv, uint32_t *status);
+/* Gives the registered interface of `ifspec` a second manager table, whose
+ * managers answer its calls on the TCP server while every worker is busy
+ * (see rpc__listen). They run on an I/O thread, so they must answer at once
+ * and never block: a status that tells the client to come back later. Null
+ * takes the table away: such calls are then answered with the fault
+ * rpc__s_server_busy. rpc__s_not_registered without a registration. */
+NCS_API void rpc__register_busy_mgr(const rpc__if_spec_t *ifspec, const void *busy_mgr_epv, uint32_t *status);
 /* Takes the registration of the interface's UUID and version away; new
  * requests get rpc__s_unknown_if at once. Calls that already run go on to
  * their end on the old registration; the call doesn't wait for them.

@@ -8,6 +8,7 @@
 #include "ncs/runtime.h"
 
 #include <array>
+#include <atomic>
 #include <cstring>
 #include <map>
 #include <memory>
@@ -22,6 +23,7 @@ struct Registration {
     rpc__if_spec_t ifspec;
     std::vector<rpc__server_stub_t> stubs;  // ifspec.opcnt entries
     const void *mgr_epv;
+    std::atomic<const void *> busy_mgr_epv{nullptr};  // answers calls while every worker is busy
 };
 
 // An interface as the registry orders it: the UUID's 16 bytes and the version.
@@ -39,8 +41,10 @@ class Registry {
 public:
     uint32_t add(const rpc__if_spec_t &ifspec, const rpc__server_stub_t *stubs, const void *mgr_epv)
     {
-        auto registration = std::make_shared<Registration>(
-            Registration{ifspec, std::vector<rpc__server_stub_t>(stubs, stubs + ifspec.opcnt), mgr_epv});
+        auto registration = std::make_shared<Registration>();
+        registration->ifspec = ifspec;
+        registration->stubs.assign(stubs, stubs + ifspec.opcnt);
+        registration->mgr_epv = mgr_epv;
         std::unique_lock<std::shared_mutex> hold(mutex_);
         auto [where, added] = entries_.try_emplace(key_of(ifspec.id, ifspec.vers), std::move(registration));
         return added ? rpc__s_ok : rpc__s_already_registered;
@@ -52,7 +56,7 @@ public:
         return entries_.erase(key_of(ifspec.id, ifspec.vers)) != 0 ? rpc__s_ok : rpc__s_not_registered;
     }
 
-    std::shared_ptr<const Registration> find(const uuid__t &id, uint32_t vers)
+    std::shared_ptr<Registration> find(const uuid__t &id, uint32_t vers)
     {
         std::shared_lock<std::shared_mutex> hold(mutex_);
         auto where = entries_.find(key_of(id, vers));
@@ -61,7 +65,7 @@ public:
 
 private:
     std::shared_mutex mutex_;  // guards entries_; never held while a stub runs
-    std::map<Key, std::shared_ptr<const Registration>> entries_;
+    std::map<Key, std::shared_ptr<Registration>> entries_;
 };
 
 Registry &registry()
@@ -89,7 +93,7 @@ void drop_reply(const ncs::Dispatched &outcome)
 namespace ncs {
 
 Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint32_t drep, void *in_pkt,
-                    uint32_t in_len, void *out_pkt, uint32_t out_max)
+                    uint32_t in_len, void *out_pkt, uint32_t out_max, bool busy)
 {
     Dispatched outcome;
     std::shared_ptr<const Registration> registration = registry().find(if_id, if_vers);
@@ -99,6 +103,11 @@ Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint
     }
     if (opnum >= registration->stubs.size() || registration->stubs[opnum] == nullptr) {
         outcome.fault = rpc__s_op_rng_error;
+        return outcome;
+    }
+    const void *managers = busy ? registration->busy_mgr_epv.load() : registration->mgr_epv;
+    if (busy && managers == nullptr) {
+        outcome.fault = rpc__s_server_busy;
         return outcome;
     }
 
@@ -116,7 +125,7 @@ Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint
     try {
         raised = exc::guard(&frame, __FILE__, __LINE__, [&] {
             registration->stubs[opnum](&server_handle, in_pkt, in_len, out_pkt, out_max, &call_drep,
-                                       registration->mgr_epv, &outcome.reply_pkt, &outcome.reply_len, &must_free,
+                                       managers, &outcome.reply_pkt, &outcome.reply_len, &must_free,
                                        &st);
         });
     } catch (...) {
@@ -158,6 +167,18 @@ void rpc__register_mgr(const uuid__t *, const rpc__if_spec_t *ifspec, const rpc_
     } catch (const std::bad_alloc &) {
         set_status(status, rpc__s_no_memory);
     }
+}
+
+void rpc__register_busy_mgr(const rpc__if_spec_t *ifspec, const void *busy_mgr_epv, uint32_t *status)
+{
+    std::shared_ptr<Registration> registration =
+        ifspec != nullptr ? registry().find(ifspec->id, ifspec->vers) : nullptr;
+    if (registration == nullptr) {
+        set_status(status, rpc__s_not_registered);
+        return;
+    }
+    registration->busy_mgr_epv = busy_mgr_epv;
+    set_status(status, rpc__s_ok);
 }
 
 void rpc__unregister(const rpc__if_spec_t *ifspec, uint32_t *status)

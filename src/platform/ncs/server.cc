@@ -1,27 +1,33 @@
-// The RPC server: an acceptor and one session per connection on an
-// io_context that the server's threads run.
+// The RPC server: an acceptor, I/O threads that read requests and write
+// replies, and worker threads that run the managers.
 //
-// Each thread of the server runs an io_context of its own, and an accepted
-// connection belongs to one of them, chosen in turn: no handler ever hands
-// work to another thread, so the threads never wake or wait for each other.
-// Calls of connections of one thread take turns; calls at once are bounded
-// by the threads. The acceptor has a thread of its own, so connections are
-// taken while every call thread is busy.
-//
-// A session reads one request frame at a time, dispatches it on its thread
-// and writes the answer before it reads the next frame, so a session has one
-// operation outstanding at a time, plus its timer; both run on the session's
-// strand.
+// Each I/O thread runs an io_context of its own, and an accepted connection
+// belongs to one of them, chosen in turn. A session reads one request frame
+// at a time and hands the call to an idle worker; the worker runs the server
+// stub and the manager, then posts the reply back to the session's thread,
+// which writes it before it reads the next frame. A manager that blocks (an
+// open of a FIFO, a stalled network mount) holds its worker only: the I/O
+// threads go on serving every other connection. When no worker is idle, the
+// call is answered at once on the I/O thread, through the busy managers that
+// the host registered for the interface (a well-formed reply whose status
+// says busy, so the client backs off and tries again) or, without them, with
+// the fault rpc__s_server_busy.
 //
 // Every completion that goes through the io_context costs a trip through its
-// queue and its epoll. So a session's socket is non-blocking, and a
-// body that is already there, or a reply that the socket buffer takes whole,
-// moves on the spot; only the rest waits for an asynchronous operation. The
-// idle timer isn't re-armed per call either: it fires once per idle period
-// and looks at when the session began its present wait for the peer.
+// queue and its epoll. So a session's socket is non-blocking, and bytes that
+// are already there, or a reply that the socket buffer takes whole, move on
+// the spot; only the rest waits for an asynchronous operation. The session's
+// one timer fires at the earlier of its two deadlines: the idle time since
+// the session began its present wait for the peer, and the frame time since
+// the first byte of the frame under way arrived.
 //
-// Lock order: Server::mutex_ guards the session table and the stop flag and
-// is never held while a handler runs or a socket is touched.
+// What a peer can hold is bounded: connections per peer address and in all,
+// the time a frame may take to arrive, and the memory of bodies that are
+// still arriving, counted as their bytes come in and capped for the server.
+//
+// Lock order: Server::mutex_ guards the session table, the per-peer counts
+// and the stop flag, and is never held while a handler runs or a socket is
+// touched. Workers::mutex_ guards the worker queue only.
 #include "ncs/server.h"
 
 #include "ncs/frame.h"
@@ -32,9 +38,13 @@
 #include <array>
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
+#include <deque>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -44,9 +54,16 @@ using ncs::net::tcp;
 
 constexpr uint32_t kDefaultThreads = 4;
 constexpr uint32_t kMaxThreads = 64;
+constexpr uint32_t kMaxIoThreads = 2;
 constexpr uint32_t kDefaultMaxConnections = 256;
+constexpr uint32_t kDefaultMaxConnectionsPerPeer = 64;
 constexpr uint32_t kDefaultIdleTimeoutS = 300;
+constexpr uint32_t kDefaultFrameTimeoutS = 30;
+constexpr uint32_t kDefaultMaxPendingBodyMiB = 64;
 constexpr int kBacklog = 128;
+// An accept that fails (out of descriptors) is tried again after this, not
+// at once.
+constexpr auto kAcceptRetry = std::chrono::milliseconds(100);
 // Room for a reply body that the server offers every call: small replies
 // need no packet of their own.
 constexpr uint32_t kOfferedReply = 8192;
@@ -71,10 +88,92 @@ Packet allocate_packet(uint32_t size)
 
 class Server;
 
+// What the server allows a peer, from the environment at rpc__listen.
+struct Limits {
+    uint32_t max_connections;
+    uint32_t max_connections_per_peer;
+    std::chrono::seconds idle_timeout;
+    std::chrono::seconds frame_timeout;
+    uint64_t max_pending_body;  // bytes of bodies still arriving, all sessions together
+
+    static Limits from_environment()
+    {
+        return {ncs::setting("NCS_MAX_CONNECTIONS", kDefaultMaxConnections),
+                ncs::setting("NCS_MAX_CONNECTIONS_PER_PEER", kDefaultMaxConnectionsPerPeer),
+                std::chrono::seconds(ncs::setting("NCS_IDLE_TIMEOUT_S", kDefaultIdleTimeoutS)),
+                std::chrono::seconds(ncs::setting("NCS_FRAME_TIMEOUT_S", kDefaultFrameTimeoutS)),
+                uint64_t{ncs::setting("NCS_MAX_PENDING_BODY_MB", kDefaultMaxPendingBodyMiB)} << 20};
+    }
+};
+
+// The threads that run calls. A call is handed over only to an idle worker,
+// so no call ever waits in a queue behind one that blocks.
+class Workers {
+public:
+    explicit Workers(uint32_t count) : idle_(count)
+    {
+        for (uint32_t i = 0; i < count; ++i)
+            threads_.emplace_back([this] { work(); });
+    }
+    // Runs what was handed over, then joins the threads.
+    ~Workers()
+    {
+        {
+            std::lock_guard<std::mutex> hold(mutex_);
+            stopping_ = true;
+        }
+        wake_.notify_all();
+        for (auto &thread : threads_)
+            thread.join();
+    }
+    Workers(const Workers &) = delete;
+    Workers &operator=(const Workers &) = delete;
+
+    // Runs `job` on an idle worker; false, and `job` untouched, when none is.
+    bool try_run(std::function<void()> &job)
+    {
+        {
+            std::lock_guard<std::mutex> hold(mutex_);
+            if (idle_ == 0 || stopping_)
+                return false;
+            --idle_;
+            jobs_.push_back(std::move(job));
+        }
+        wake_.notify_one();
+        return true;
+    }
+
+private:
+    void work()
+    {
+        for (;;) {
+            std::function<void()> job;
+            {
+                std::unique_lock<std::mutex> hold(mutex_);
+                wake_.wait(hold, [this] { return stopping_ || !jobs_.empty(); });
+                if (jobs_.empty())
+                    return;
+                job = std::move(jobs_.front());
+                jobs_.pop_front();
+            }
+            job();
+            std::lock_guard<std::mutex> hold(mutex_);
+            ++idle_;
+        }
+    }
+
+    std::mutex mutex_;  // guards the three members below
+    std::condition_variable wake_;
+    std::deque<std::function<void()>> jobs_;
+    uint32_t idle_;
+    bool stopping_ = false;
+    std::vector<std::thread> threads_;
+};
+
 class Session : public std::enable_shared_from_this<Session> {
 public:
-    Session(Server &server, tcp::socket socket)
-        : server_(server), socket_(std::move(socket)), timer_(socket_.get_executor())
+    Session(Server &server, tcp::socket socket, std::string peer)
+        : server_(server), socket_(std::move(socket)), timer_(socket_.get_executor()), peer_(std::move(peer))
     {
     }
     ~Session();
@@ -94,30 +193,46 @@ public:
             close();
     }
     // Answers the connection with a fault that names no call, and closes it.
-    void refuse(uint32_t status) { send_fault(0, status, true); }
+    void refuse(uint32_t status) { send_fault(0, status); }
     asio::any_io_executor executor() { return socket_.get_executor(); }
+    const std::string &peer() const { return peer_; }
 
 private:
+    using Clock = asio::steady_timer::clock_type;
+
     void read_header();
-    void on_header(const asio::error_code &ec);
-    void on_body(const asio::error_code &ec);
-    void send_fault(uint32_t call_id, uint32_t status, bool closing);
+    void on_header_bytes(const asio::error_code &ec, size_t got);
+    void on_header();
+    void take_body();
+    void read_body();
+    void on_body_bytes(const asio::error_code &ec, size_t got);
+    void call();
+    void on_called(const ncs::Dispatched &outcome);
+    void send_fault(uint32_t call_id, uint32_t status);
     void send(std::array<asio::const_buffer, 2> buffers, bool closing);
     void on_sent(const asio::error_code &ec, bool closing);
-    void touch() { waiting_since_ = asio::steady_timer::clock_type::now(); }
+    void touch() { waiting_since_ = Clock::now(); }
     void arm_timer();
+    void release_body();
     void close()
     {
         asio::error_code ignored;
         socket_.close(ignored);
         timer_.cancel();
+        release_body();
     }
 
     Server &server_;
     tcp::socket socket_;
     asio::steady_timer timer_;
-    asio::steady_timer::time_point waiting_since_;  // start of the present wait for the peer
+    const std::string peer_;          // the peer's address, which its connection count goes by
+    Clock::time_point waiting_since_;  // start of the present wait for the peer
+    Clock::time_point frame_started_;  // first byte of the frame under way
+    bool in_frame_ = false;            // a frame has begun to arrive and isn't whole yet
     ncs::frame::Bytes in_header_;
+    size_t header_got_ = 0;
+    uint32_t body_got_ = 0;
+    uint64_t charged_ = 0;  // bytes of this body counted against the server's cap
     ncs::frame::Bytes out_header_;
     ncs::frame::Header request_;
     Packet request_pkt_;
@@ -128,8 +243,8 @@ private:
 
 class Server {
 public:
-    Server(uint32_t threads, uint32_t max_connections, std::chrono::seconds idle_timeout)
-        : max_connections_(max_connections), idle_timeout_(idle_timeout), contexts_(make_contexts(threads))
+    Server(uint32_t threads, const Limits &limits)
+        : limits_(limits), contexts_(make_contexts(std::min(threads, kMaxIoThreads))), workers_(threads)
     {
     }
     Server(const Server &) = delete;
@@ -183,11 +298,13 @@ public:
         asio::post(acceptor_strand_, [this] {
             asio::error_code ignored;
             acceptor_.close(ignored);
+            accept_retry_.cancel();
         });
         for (auto &session : sessions)
             asio::post(session->executor(), [session] { session->stop(); });
         sessions.clear();
-        // Each thread ends once its connections are closed.
+        // Each thread ends once its connections are closed; a call handed to
+        // a worker holds its thread until its reply is sent.
         busy_.clear();
         for (auto &thread : threads_)
             thread.join();
@@ -195,7 +312,8 @@ public:
     }
 
     const tcp::endpoint &local() const { return local_; }
-    std::chrono::seconds idle_timeout() const { return idle_timeout_; }
+    const Limits &limits() const { return limits_; }
+    Workers &workers() { return workers_; }
     bool stopping()
     {
         std::lock_guard<std::mutex> hold(mutex_);
@@ -205,8 +323,22 @@ public:
     void forget(Session *session)
     {
         std::lock_guard<std::mutex> hold(mutex_);
-        sessions_.erase(session);
+        if (sessions_.erase(session) != 0 && --per_peer_[session->peer()] == 0)
+            per_peer_.erase(session->peer());
     }
+
+    // Counts `bytes` of a body that is still arriving; false, and nothing
+    // counted, when they would take the bodies under way above their cap.
+    bool charge(uint64_t bytes)
+    {
+        uint64_t held = pending_body_.load();
+        do {
+            if (held + bytes > limits_.max_pending_body)
+                return false;
+        } while (!pending_body_.compare_exchange_weak(held, held + bytes));
+        return true;
+    }
+    void discharge(uint64_t bytes) { pending_body_ -= bytes; }
 
     rpc__server_stats_t stats()
     {
@@ -226,26 +358,43 @@ private:
                                                                             tcp::socket socket) {
                                    if (ec == asio::error::operation_aborted || !acceptor_.is_open())
                                        return;
-                                   if (!ec)
+                                   if (!ec) {
                                        admit(std::move(socket));
-                                   accept();
+                                       accept();
+                                       return;
+                                   }
+                                   // Out of descriptors or the like: again a little later.
+                                   accept_retry_.expires_after(kAcceptRetry);
+                                   accept_retry_.async_wait(asio::bind_executor(
+                                       acceptor_strand_, [this](const asio::error_code &wait_ec) {
+                                           if (!wait_ec && acceptor_.is_open())
+                                               accept();
+                                       }));
                                }));
     }
 
+    // Takes a connection on, or answers it busy and closes it when the server
+    // or its peer's address is at its limit: the newest connection is the
+    // one refused.
     void admit(tcp::socket socket)
     {
-        asio::error_code ignored;
-        socket.set_option(tcp::no_delay(true), ignored);
-        auto session = std::make_shared<Session>(*this, std::move(socket));
+        asio::error_code ec;
+        socket.set_option(tcp::no_delay(true), ec);
+        tcp::endpoint remote = socket.remote_endpoint(ec);
+        auto session = std::make_shared<Session>(*this, std::move(socket), ec ? "" : remote.address().to_string());
         bool refused = false;
         {
             std::lock_guard<std::mutex> hold(mutex_);
             ++accepted_;
             if (stopping_)
                 return;
-            refused = sessions_.size() >= max_connections_;
-            if (!refused)
+            auto peer = per_peer_.find(session->peer());
+            refused = sessions_.size() >= limits_.max_connections ||
+                      (peer != per_peer_.end() && peer->second >= limits_.max_connections_per_peer);
+            if (!refused) {
                 sessions_.emplace(session.get(), session);
+                ++per_peer_[session->peer()];
+            }
         }
         asio::post(session->executor(), [session, refused] {
             if (refused)
@@ -258,7 +407,7 @@ private:
     static std::vector<std::unique_ptr<asio::io_context>> make_contexts(uint32_t count)
     {
         std::vector<std::unique_ptr<asio::io_context>> contexts;
-        for (uint32_t i = 0; i < count; ++i)
+        for (uint32_t i = 0; i < std::max(count, 1u); ++i)
             contexts.push_back(std::make_unique<asio::io_context>(1));
         return contexts;
     }
@@ -275,45 +424,60 @@ private:
         }
     }
 
-    const uint32_t max_connections_;
-    const std::chrono::seconds idle_timeout_;
+    const Limits limits_;
 
     // Declared before contexts_: sessions that a context still holds when it
     // goes unregister themselves here.
-    std::mutex mutex_;  // guards the three members below
+    std::mutex mutex_;  // guards the four members below
     bool stopping_ = false;
     uint64_t accepted_ = 0;
     std::map<Session *, std::weak_ptr<Session>> sessions_;
+    std::map<std::string, uint32_t> per_peer_;  // open connections per peer address
     std::atomic<uint32_t> calls_{0};
+    std::atomic<uint64_t> pending_body_{0};
 
-    // One per call thread.
+    // One per I/O thread.
     std::vector<std::unique_ptr<asio::io_context>> contexts_;
     std::vector<asio::executor_work_guard<asio::io_context::executor_type>> busy_;  // till stop
     size_t next_context_ = 0;  // on the acceptor's strand only
     asio::io_context accept_io_{1};
     asio::strand<asio::io_context::executor_type> acceptor_strand_{asio::make_strand(accept_io_)};
     tcp::acceptor acceptor_{acceptor_strand_};
+    asio::steady_timer accept_retry_{acceptor_strand_};
     tcp::endpoint local_;
     std::vector<std::thread> threads_;
+    // Declared after the contexts: the workers are joined first, so no call
+    // posts its reply to a context that is gone.
+    Workers workers_;
 };
 
 Session::~Session()
 {
+    release_body();
     server_.forget(this);
 }
 
-// Fires one idle period after the session began to wait for its peer: for
-// a request frame since the last reply went out, or for the peer to read a
-// reply since it began to go out. A manager's run never counts, since the
-// timer's handler can't run on the strand meanwhile. A session that has
-// moved on since waits for the rest of its period.
+// Fires at the earlier of the session's deadlines: one idle period after it
+// began to wait for its peer (for a request frame since the last reply went
+// out, or for the peer to read a reply since it began to go out), and one
+// frame time after the first byte of a frame that isn't whole yet. A call
+// that a worker runs never counts. A session that has moved on since waits
+// for the rest of its period.
 void Session::arm_timer()
 {
-    timer_.expires_at(waiting_since_ + server_.idle_timeout());
+    const Limits &limits = server_.limits();
+    Clock::time_point due = waiting_since_ + limits.idle_timeout;
+    if (in_frame_)
+        due = std::min(due, frame_started_ + limits.frame_timeout);
+    timer_.expires_at(due);
     timer_.async_wait([self = shared_from_this()](const asio::error_code &ec) {
         if (ec || !self->socket_.is_open())
             return;
-        if (self->waiting_since_ + self->server_.idle_timeout() <= asio::steady_timer::clock_type::now())
+        const Limits &limits = self->server_.limits();
+        const Clock::time_point now = Clock::now();
+        const bool idle = !self->in_call_ && self->waiting_since_ + limits.idle_timeout <= now;
+        const bool late = self->in_frame_ && self->frame_started_ + limits.frame_timeout <= now;
+        if (idle || late)
             self->close();
         else
             self->arm_timer();
@@ -326,55 +490,143 @@ void Session::read_header()
         close();
         return;
     }
-    asio::async_read(socket_, asio::buffer(in_header_),
-                     [self = shared_from_this()](const asio::error_code &ec, size_t) { self->on_header(ec); });
+    header_got_ = 0;
+    socket_.async_read_some(asio::buffer(in_header_),
+                            [self = shared_from_this()](const asio::error_code &ec, size_t got) {
+                                self->on_header_bytes(ec, got);
+                            });
 }
 
-void Session::on_header(const asio::error_code &ec)
-{
-    if (ec || !ncs::frame::decode(in_header_, request_) || request_.kind != ncs::frame::kRequest) {
-        close();
-        return;
-    }
-    if (request_.body_len > RPC_MAX_BODY) {
-        send_fault(request_.call_id, rpc__s_too_big, true);
-        return;
-    }
-    request_pkt_ = allocate_packet(request_.body_len);
-    if (request_pkt_ == nullptr) {
-        send_fault(request_.call_id, rpc__s_no_memory, true);
-        return;
-    }
-    auto *body = static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS;
-    // What has arrived is taken now; the rest is waited for.
-    asio::error_code now;
-    const size_t got = asio::read(socket_, asio::buffer(body, request_.body_len), ncs::net::whole, now);
-    if (now != asio::error::would_block) {
-        on_body(now);
-        return;
-    }
-    asio::async_read(socket_, asio::buffer(body + got, request_.body_len - got), ncs::net::whole,
-                     [self = shared_from_this()](const asio::error_code &ec, size_t) { self->on_body(ec); });
-}
-
-void Session::on_body(const asio::error_code &ec)
+void Session::on_header_bytes(const asio::error_code &ec, size_t got)
 {
     if (ec) {
         close();
         return;
     }
+    if (header_got_ == 0 && got > 0) {
+        in_frame_ = true;
+        frame_started_ = Clock::now();
+        if (frame_started_ + server_.limits().frame_timeout < timer_.expiry())
+            arm_timer();
+    }
+    header_got_ += got;
+    if (header_got_ == sizeof in_header_) {
+        on_header();
+        return;
+    }
+    socket_.async_read_some(asio::buffer(in_header_ + header_got_, sizeof in_header_ - header_got_),
+                            [self = shared_from_this()](const asio::error_code &ec, size_t got) {
+                                self->on_header_bytes(ec, got);
+                            });
+}
+
+void Session::on_header()
+{
+    if (!ncs::frame::decode(in_header_, request_) || request_.kind != ncs::frame::kRequest) {
+        close();
+        return;
+    }
+    if (request_.body_len > RPC_MAX_BODY) {
+        send_fault(request_.call_id, rpc__s_too_big);
+        return;
+    }
+    body_got_ = 0;
+    if (request_.body_len == 0) {
+        call();
+        return;
+    }
+    // The body's room is taken once its first byte is there, not on the
+    // header's word alone.
+    asio::error_code ec;
+    if (socket_.available(ec) > 0 && !ec) {
+        take_body();
+        return;
+    }
+    socket_.async_wait(tcp::socket::wait_read, [self = shared_from_this()](const asio::error_code &ec) {
+        if (ec)
+            self->close();
+        else
+            self->take_body();
+    });
+}
+
+void Session::take_body()
+{
+    request_pkt_ = allocate_packet(request_.body_len);
+    if (request_pkt_ == nullptr)
+        send_fault(request_.call_id, rpc__s_no_memory);
+    else
+        read_body();
+}
+
+// Takes what has arrived of the body now, and waits for the rest. The bytes
+// count against the server's cap on bodies under way as they come in.
+void Session::read_body()
+{
+    auto *body = static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS;
+    asio::error_code now;
+    const size_t got = socket_.read_some(asio::buffer(body + body_got_, request_.body_len - body_got_), now);
+    if (now == asio::error::would_block) {
+        socket_.async_read_some(asio::buffer(body + body_got_, request_.body_len - body_got_),
+                                [self = shared_from_this()](const asio::error_code &ec, size_t got) {
+                                    self->on_body_bytes(ec, got);
+                                });
+        return;
+    }
+    on_body_bytes(now, got);
+}
+
+void Session::on_body_bytes(const asio::error_code &ec, size_t got)
+{
+    if (ec) {
+        close();
+        return;
+    }
+    if (!server_.charge(got)) {
+        send_fault(request_.call_id, rpc__s_server_busy);
+        return;
+    }
+    charged_ += got;
+    body_got_ += static_cast<uint32_t>(got);
+    if (body_got_ < request_.body_len)
+        read_body();
+    else
+        call();
+}
+
+// Hands the whole request to an idle worker. With none idle, the call is
+// answered here through the interface's busy managers.
+void Session::call()
+{
+    in_frame_ = false;
+    release_body();
     if (offered_pkt_ == nullptr)
         offered_pkt_ = allocate_packet(kOfferedReply);
-    void *offered = offered_pkt_.get();
     in_call_ = true;
-    server_.call_begins();
-    ncs::Dispatched outcome =
-        ncs::dispatch(request_.if_id, request_.if_vers, request_.opnum, request_.drep, request_pkt_.get(),
-                      request_.body_len, offered, offered != nullptr ? kOfferedReply : 0);
-    server_.call_ends();
+    // The guard keeps the session's thread running until the reply is posted back.
+    auto guard = std::make_shared<asio::executor_work_guard<asio::any_io_executor>>(socket_.get_executor());
+    std::function<void()> job = [self = shared_from_this(), guard] {
+        Session &session = *self;
+        session.server_.call_begins();
+        ncs::Dispatched outcome = ncs::dispatch(
+            session.request_.if_id, session.request_.if_vers, session.request_.opnum, session.request_.drep,
+            session.request_pkt_.get(), session.request_.body_len, session.offered_pkt_.get(),
+            session.offered_pkt_ != nullptr ? kOfferedReply : 0, false);
+        session.server_.call_ends();
+        asio::post(session.socket_.get_executor(), [self, outcome] { self->on_called(outcome); });
+    };
+    if (server_.workers().try_run(job))
+        return;
+    on_called(ncs::dispatch(request_.if_id, request_.if_vers, request_.opnum, request_.drep, request_pkt_.get(),
+                            request_.body_len, offered_pkt_.get(), offered_pkt_ != nullptr ? kOfferedReply : 0,
+                            true));
+}
+
+void Session::on_called(const ncs::Dispatched &outcome)
+{
     request_pkt_.reset();
     if (outcome.fault != rpc__s_ok) {
-        send_fault(request_.call_id, outcome.fault, false);
+        send_fault(request_.call_id, outcome.fault);
         return;
     }
     if (outcome.must_free)
@@ -392,17 +644,26 @@ void Session::on_body(const asio::error_code &ec)
          false);
 }
 
-void Session::send_fault(uint32_t call_id, uint32_t status, bool closing)
+// A fault ends the connection: whatever the peer sends after it is not read.
+void Session::send_fault(uint32_t call_id, uint32_t status)
 {
+    in_frame_ = false;
+    release_body();
     ncs::frame::Header fault = request_;
     fault.kind = ncs::frame::kFault;
-    fault.flags = closing ? ncs::frame::kClosing : 0;
+    fault.flags = ncs::frame::kClosing;
     fault.call_id = call_id;
     fault.drep = NCS_DREP_LOCAL;
     fault.body_len = 0;
     fault.fault = status;
     ncs::frame::encode(fault, out_header_);
-    send({asio::buffer(out_header_), asio::const_buffer()}, closing);
+    send({asio::buffer(out_header_), asio::const_buffer()}, true);
+}
+
+void Session::release_body()
+{
+    server_.discharge(charged_);
+    charged_ = 0;
 }
 
 void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
@@ -472,10 +733,8 @@ void rpc__listen(const char *host, uint32_t port, uint32_t threads, socket__addr
         else if (!endpoint_for(host != nullptr ? host : "127.0.0.1", port, endpoint))
             result = rpc__s_unknown_host;
         if (result == rpc__s_ok) {
-            auto server = std::make_unique<Server>(
-                std::min(threads > 0 ? threads : kDefaultThreads, kMaxThreads),
-                ncs::setting("NCS_MAX_CONNECTIONS", kDefaultMaxConnections),
-                std::chrono::seconds(ncs::setting("NCS_IDLE_TIMEOUT_S", kDefaultIdleTimeoutS)));
+            auto server = std::make_unique<Server>(std::min(threads > 0 ? threads : kDefaultThreads, kMaxThreads),
+                                                   Limits::from_environment());
             result = server->listen(endpoint);
             if (result == rpc__s_ok) {
                 server->start();

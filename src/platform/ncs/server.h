@@ -1,17 +1,27 @@
-/* The RPC server of a process: listens on one TCP address and runs the
- * incoming calls of the registered interfaces (rpc__register_mgr) on a pool
- * of the runtime's threads. The managers run on those threads.
+/* The RPC server of a process: listens on one TCP address, reads requests
+ * on a few I/O threads and runs the calls of the registered interfaces
+ * (rpc__register_mgr) on a pool of worker threads. The managers run on the
+ * workers; a manager that blocks holds its worker only. A call that finds
+ * every worker busy is answered at once through the interface's busy
+ * managers (rpc__register_busy_mgr), or else with the fault
+ * rpc__s_server_busy.
  *
  * A process has at most one server. Limits, from the environment at
- * rpc__listen: "NCS_MAX_CONNECTIONS" connections at once (default 256; a
- * connection beyond is answered rpc__s_server_busy and closed), and
- * "NCS_IDLE_TIMEOUT_S" seconds (default 300) that a connection may stay
- * without a complete frame or a read reply before it is closed. Each
- * connection is served by one of the threads, given in turn as connections
- * are accepted: calls at once are bounded by the number of threads, and a
- * call waits while another call of its thread runs. A
- * request above RPC_MAX_BODY is answered rpc__s_too_big before anything is
- * allocated for it; a malformed frame closes its connection only.
+ * rpc__listen, each defending against what a peer could otherwise hold:
+ * "NCS_MAX_CONNECTIONS" connections at once (default 256) and
+ * "NCS_MAX_CONNECTIONS_PER_PEER" from one peer address (default 64): the
+ * newest connection beyond either is answered rpc__s_server_busy and
+ * closed. "NCS_IDLE_TIMEOUT_S" seconds (default 300) that a connection may
+ * wait without a request or with an unread reply. "NCS_FRAME_TIMEOUT_S"
+ * seconds (default 30) for a frame to arrive in full once its first byte
+ * came. "NCS_MAX_PENDING_BODY_MB" MiB (default 64) of request bodies still
+ * arriving, all connections together: a body's room is taken when its first
+ * byte arrives and its bytes are counted as they come, and a body that
+ * would pass the cap is answered rpc__s_server_busy. A request above
+ * RPC_MAX_BODY is answered rpc__s_too_big before anything is allocated for
+ * it. A malformed frame closes its connection; so does every fault the
+ * server sends. An accept that fails (out of descriptors) is tried again
+ * after 100 ms.
  *
  * All functions are callable from any thread but the server's own (a manager
  * must not stop the server it runs on). */
@@ -26,7 +36,8 @@ extern "C" {
 
 /* Starts the server on `host` (an IPv4 or IPv6 literal or a host name; null:
  * 127.0.0.1; "::" takes IPv4 too) at `port` (0: a free port) with `threads`
- * threads for calls (0: 4; at most 64). On success `*bound` and `*bound_len`,
+ * workers, the calls it runs at once (0: 4; at most 64), and up to two I/O
+ * threads. On success `*bound` and `*bound_len`,
  * when not null, hold the address listened on with its port. Statuses:
  * rpc__s_unknown_host, rpc__s_cant_listen (the address is taken, or the
  * process already has a server); `bound` is unchanged on failure. */
@@ -35,7 +46,9 @@ NCS_API void rpc__listen(const char *host, uint32_t port, uint32_t threads, sock
 
 /* Stops the server: no further connection is accepted, connections that
  * wait for a request are closed, calls under way run to their end and send
- * their replies, then every thread of the server is joined. Nothing happens
+ * their replies, then every thread of the server is joined. A call whose
+ * manager blocks keeps this waiting: a host that must end anyway ends its
+ * process, which closes that call's connection without a reply. Nothing happens
  * without a server. A new rpc__listen may follow. */
 NCS_API void rpc__stop_listening(void);
 

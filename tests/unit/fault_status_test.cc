@@ -63,7 +63,7 @@ private:
     std::thread thread_;
 };
 
-TEST(HostilePeer, NoFaultStatusReadsAsACallThatRanToItsEnd)
+TEST(FaultStatus, NoFaultStatusReadsAsACallThatRanToItsEnd)
 {
     const struct { uint32_t sent; dpx_status status; } cases[] = {
         {EXC1_FRAME_SET, rpc__s_protocol_error},
@@ -89,7 +89,7 @@ TEST(HostilePeer, NoFaultStatusReadsAsACallThatRanToItsEnd)
     }
 }
 
-TEST(HostilePeer, ARaiseOfTheNoFaultValueCarriesAStatusOfItsOwn)
+TEST(FaultStatus, ARaiseOfTheNoFaultValueCarriesAStatusOfItsOwn)
 {
     EXC1_FRAME frame;
     EXPECT_EQ(exc::guard(&frame, __FILE__, __LINE__, [] { EXC1__Raise(EXC1_Thread(), EXC1_FRAME_SET); }),
