@@ -4,7 +4,7 @@
 set -euo pipefail
 
 packages=(g++ cmake make pkg-config zlib1g-dev libicu-dev libasio-dev libgtest-dev libgmock-dev
-          libbenchmark-dev openjdk-17-jdk-headless clang libclang-rt-14-dev iproute2 nftables)
+          libbenchmark-dev libssl-dev openssl openjdk-17-jdk-headless clang libclang-rt-14-dev iproute2 nftables)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

@@ -21,6 +21,7 @@ namespace {
 const char kUsage[] =
     "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub]\n"
     "                  [--advertise HOST:PORT] [--renew SECONDS] [--broker] [--confine]\n"
+    "                  [--read-only] [--tls-cert FILE --tls-key FILE --tls-ca FILE]\n"
     "\n"
     "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
     "\n"
@@ -42,6 +43,12 @@ const char kUsage[] =
     "  --confine           refuse (0xF11E0001) a path whose real location, symbolic links\n"
     "                      resolved, leaves DIR/NAME; off by default, when links in the\n"
     "                      depot are followed wherever they point (sets DPX_CONFINE=1)\n"
+    "  --read-only         refuse every put (0xF11E0011, request declined by the peer)\n"
+    "  --tls-cert FILE     TLS 1.3 on every connection, with this certificate (PEM chain),\n"
+    "  --tls-key FILE      its key (refused when others may read it),\n"
+    "  --tls-ca FILE       and the CA whose certificates clients must present; plain\n"
+    "                      clients are refused. SIGHUP reloads the three files: new\n"
+    "                      connections use them, open ones keep theirs\n"
     "  --help              this text\n"
     "\n"
     "When ready it prints one line \"listening on HOST:PORT\" on standard output.\n"
@@ -76,6 +83,8 @@ struct Options {
     bool hub = false;
     bool broker = false;
     bool confine = false;
+    bool read_only = false;
+    std::string tls_cert, tls_key, tls_ca;  // all empty: plain TCP
 };
 
 // The managers that answer while every thread that runs calls is busy: busy,
@@ -99,6 +108,25 @@ void busy_list_nodes(handle_t, dpx_node_filter, int16_t *, int16_t, dpx_status *
     *status = DPX_E_BUSY;
 }
 const dpx_transfer_v1_epv_t kBusyManagers = {busy_get_chunks, busy_put_chunks, busy_agent_query, busy_list_nodes};
+
+// The managers the daemon registers: the library's, behind its rights. A
+// refused call is answered "request declined" (DPX_E_QUIET): the client
+// neither retries it nor drops its binding.
+bool g_read_only = false;  // set once before the server takes calls
+
+void guarded_put_chunks(handle_t handle, dpx_file_desc desc, uint32_t crc, uint8_t state, int16_t *last,
+                        int16_t max, dpx_status *status, dpx_chunk *buffer)
+{
+    if (g_read_only) {
+        std::fprintf(stderr, "dpx-agentd: put of %.*s refused: read-only\n", static_cast<int>(sizeof desc.path),
+                     desc.path);
+        *status = DPX_E_QUIET;
+        return;
+    }
+    dpx_put_chunks(handle, desc, crc, state, last, max, status, buffer);
+}
+const dpx_transfer_v1_epv_t kGuardedManagers = {dpx_get_chunks, guarded_put_chunks, dpx_agent_query,
+                                                dpx_list_nodes};
 
 // How long a stop waits for calls under way before the process ends without them.
 constexpr auto kStopGrace = std::chrono::seconds(5);
@@ -188,6 +216,13 @@ int main(int argc, char **argv)
             options.broker = true;
         } else if (arg == "--confine") {
             options.confine = true;
+        } else if (arg == "--read-only") {
+            options.read_only = true;
+        } else if (arg == "--tls-cert" || arg == "--tls-key" || arg == "--tls-ca") {
+            const char *v = value(arg.c_str());
+            if (v == nullptr)
+                return 2;
+            (arg == "--tls-cert" ? options.tls_cert : arg == "--tls-key" ? options.tls_key : options.tls_ca) = v;
         } else {
             return usage_error(("unknown argument " + arg).c_str());
         }
@@ -196,12 +231,16 @@ int main(int argc, char **argv)
         return usage_error("--depot and --product are required");
     if (!options.advertise_host.empty() && !options.hub)
         return usage_error("--advertise goes with --hub");
+    const bool tls = !options.tls_cert.empty() || !options.tls_key.empty() || !options.tls_ca.empty();
+    if (tls && (options.tls_cert.empty() || options.tls_key.empty() || options.tls_ca.empty()))
+        return usage_error("--tls-cert, --tls-key and --tls-ca go together");
 
     // The signals are taken by the wait below; every thread inherits the mask.
     sigset_t stop_signals;
     sigemptyset(&stop_signals);
     sigaddset(&stop_signals, SIGTERM);
     sigaddset(&stop_signals, SIGINT);
+    sigaddset(&stop_signals, SIGHUP);
     pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
     std::signal(SIGPIPE, SIG_IGN);
 
@@ -229,6 +268,15 @@ int main(int argc, char **argv)
             return 1;
         }
     }
+    if (tls) {
+        rpc__tls_server(options.tls_cert.c_str(), options.tls_key.c_str(), options.tls_ca.c_str(), &status);
+        if (status != rpc__s_ok) {
+            log_line("cannot use the TLS files", status);
+            if (options.broker)
+                lb__stop_broker();
+            return 1;
+        }
+    }
     socket__addr_t bound;
     uint32_t bound_len = sizeof bound;
     rpc__listen(options.host.c_str(), options.port, options.threads, &bound, &bound_len, &status);
@@ -239,6 +287,10 @@ int main(int argc, char **argv)
         return 1;
     }
     dpx_agent_init();
+    // The library's managers, behind the daemon's rights.
+    dpx_rpc_unregister();
+    g_read_only = options.read_only;
+    rpc__register_mgr(&uuid__nil, &dpx_transfer_v1_if_spec, dpx_transfer_v1_server_epv, &kGuardedManagers, &status);
     rpc__register_busy_mgr(&dpx_transfer_v1_if_spec, &kBusyManagers, &status);
 
     lb__entry_t entry;
@@ -262,22 +314,32 @@ int main(int argc, char **argv)
     bool v6 = std::strchr(name, ':') != nullptr;
     std::printf("listening on %s%s%s:%u\n", v6 ? "[" : "", name, v6 ? "]" : "", port);
     std::fflush(stdout);
-    std::fprintf(stderr, "dpx-agentd: serving %s/%s with %u threads%s%s\n", options.depot.c_str(),
+    std::fprintf(stderr, "dpx-agentd: serving %s/%s with %u threads%s%s%s%s\n", options.depot.c_str(),
                  options.product.c_str(), options.threads, options.hub ? ", hub" : "",
-                 options.broker ? ", broker" : "");
+                 options.broker ? ", broker" : "", tls ? ", TLS" : "", options.read_only ? ", read-only" : "");
 
     // Registering again renews the entry, in its place, at a broker that has
     // it, and makes it anew at one that was restarted. The embedded broker goes and comes
     // with this process: nothing to renew.
     const bool renew = options.hub && !options.broker && options.renew_s > 0;
     int signal_number = -1;
-    while (signal_number < 0) {
+    for (;;) {
         if (!renew) {
             sigwait(&stop_signals, &signal_number);
-            break;
+        } else {
+            const timespec wait = {static_cast<time_t>(options.renew_s), 0};
+            signal_number = sigtimedwait(&stop_signals, nullptr, &wait);
         }
-        const timespec wait = {static_cast<time_t>(options.renew_s), 0};
-        signal_number = sigtimedwait(&stop_signals, nullptr, &wait);
+        if (signal_number == SIGHUP) {
+            if (tls) {
+                rpc__tls_server(options.tls_cert.c_str(), options.tls_key.c_str(), options.tls_ca.c_str(), &status);
+                if (status == rpc__s_ok)
+                    std::fprintf(stderr, "dpx-agentd: TLS files reloaded\n");
+                else
+                    log_line("cannot reload the TLS files, the old ones stay", status);
+            }
+            continue;
+        }
         if (signal_number >= 0)
             break;
         lb__register(&entry, &status);

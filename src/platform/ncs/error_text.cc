@@ -31,6 +31,11 @@ constexpr StatusText kTexts[] = {
     {rpc__s_unknown_host, "unknown host"},
     {rpc__s_invalid_handle, "invalid binding handle"},
     {rpc__s_cant_listen, "cannot listen at the address"},
+    {rpc__s_tls_required, "the server speaks TLS only: set NCS_TLS_CERT, NCS_TLS_KEY and NCS_TLS_CA"},
+    {rpc__s_tls_handshake, "TLS handshake failed: the peer refused this certificate, or does not speak TLS"},
+    {rpc__s_tls_untrusted, "TLS: the server's certificate is not from the CA, has expired, or names another host"},
+    {rpc__s_tls_settings, "TLS settings unusable: a certificate, key or CA file can't be read or used"},
+    {rpc__s_tls_key_exposed, "TLS key file readable by others: refused (chmod o-rwx)"},
     // Faults.
     {rpc__s_fault_invalid_bound, "array bound out of range"},
     {rpc__s_no_memory, "out of memory in the RPC runtime"},

@@ -40,6 +40,11 @@ extern "C" {
 #define rpc__s_unknown_host       0x1C01000Bu /* a host name can't be resolved */
 #define rpc__s_invalid_handle     0x1C01000Cu /* null or freed handle */
 #define rpc__s_cant_listen        0x1C01000Du /* the server can't listen at the address */
+#define rpc__s_tls_required       0x1C01000Eu /* a plain client at a server that speaks TLS only */
+#define rpc__s_tls_handshake      0x1C01000Fu /* the peer refused our certificate, or speaks no TLS */
+#define rpc__s_tls_untrusted      0x1C010010u /* the server's certificate: another CA, or another name */
+#define rpc__s_tls_settings       0x1C010011u /* a certificate, key or CA file that can't be used */
+#define rpc__s_tls_key_exposed    0x1C010012u /* a key file that others may read */
 /* Faults, 0x1C00xxxx: raised by a stub or a manager; not of the
  * communication module, so they pass out of a client stub as raises. */
 #define rpc__s_fault_invalid_bound 0x1C000007u

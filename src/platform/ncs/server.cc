@@ -33,12 +33,14 @@
 #include "ncs/frame.h"
 #include "ncs/net.h"
 #include "ncs/runtime.h"
+#include "ncs/tls.h"
 
 #include <algorithm>
 #include <array>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <cstring>
 #include <deque>
 #include <functional>
 #include <map>
@@ -172,8 +174,9 @@ private:
 
 class Session : public std::enable_shared_from_this<Session> {
 public:
-    Session(Server &server, tcp::socket socket, std::string peer)
-        : server_(server), socket_(std::move(socket)), timer_(socket_.get_executor()), peer_(std::move(peer))
+    Session(Server &server, tcp::socket socket, std::string peer, std::shared_ptr<ncs::tls::Context> tls)
+        : server_(server), socket_(std::move(socket)), timer_(socket_.get_executor()), peer_(std::move(peer)),
+          tls_context_(std::move(tls))
     {
     }
     ~Session();
@@ -183,6 +186,14 @@ public:
         asio::error_code ignored;
         socket_.non_blocking(true, ignored);
         touch();
+        if (tls_context_ != nullptr) {
+            // The handshake is the first frame: it has the frame's time.
+            in_frame_ = true;
+            frame_started_ = Clock::now();
+            arm_timer();
+            start_tls();
+            return;
+        }
         arm_timer();
         read_header();
     }
@@ -200,10 +211,15 @@ public:
 private:
     using Clock = asio::steady_timer::clock_type;
 
+    void start_tls();
+    // Reads some bytes: those already there at once on a plain connection,
+    // else when they come. `done` gets the error and the count.
+    template <class Done>
+    void read_some(asio::mutable_buffer buffer, Done done);
     void read_header();
     void on_header_bytes(const asio::error_code &ec, size_t got);
     void on_header();
-    void take_body();
+    void on_first_body_bytes(const asio::error_code &ec, size_t got);
     void read_body();
     void on_body_bytes(const asio::error_code &ec, size_t got);
     void call();
@@ -226,6 +242,9 @@ private:
     tcp::socket socket_;
     asio::steady_timer timer_;
     const std::string peer_;          // the peer's address, which its connection count goes by
+    std::shared_ptr<ncs::tls::Context> tls_context_;  // null for plain TCP; outlives tls_
+    std::unique_ptr<asio::ssl::stream<tcp::socket &>> tls_;
+    std::array<unsigned char, 4096> first_body_bytes_;
     Clock::time_point waiting_since_;  // start of the present wait for the peer
     Clock::time_point frame_started_;  // first byte of the frame under way
     bool in_frame_ = false;            // a frame has begun to arrive and isn't whole yet
@@ -381,7 +400,8 @@ private:
         asio::error_code ec;
         socket.set_option(tcp::no_delay(true), ec);
         tcp::endpoint remote = socket.remote_endpoint(ec);
-        auto session = std::make_shared<Session>(*this, std::move(socket), ec ? "" : remote.address().to_string());
+        auto session = std::make_shared<Session>(*this, std::move(socket), ec ? "" : remote.address().to_string(),
+                                                 ncs::tls::server_context());
         bool refused = false;
         {
             std::lock_guard<std::mutex> hold(mutex_);
@@ -491,10 +511,9 @@ void Session::read_header()
         return;
     }
     header_got_ = 0;
-    socket_.async_read_some(asio::buffer(in_header_),
-                            [self = shared_from_this()](const asio::error_code &ec, size_t got) {
-                                self->on_header_bytes(ec, got);
-                            });
+    read_some(asio::buffer(in_header_), [self = shared_from_this()](const asio::error_code &ec, size_t got) {
+        self->on_header_bytes(ec, got);
+    });
 }
 
 void Session::on_header_bytes(const asio::error_code &ec, size_t got)
@@ -514,10 +533,8 @@ void Session::on_header_bytes(const asio::error_code &ec, size_t got)
         on_header();
         return;
     }
-    socket_.async_read_some(asio::buffer(in_header_ + header_got_, sizeof in_header_ - header_got_),
-                            [self = shared_from_this()](const asio::error_code &ec, size_t got) {
-                                self->on_header_bytes(ec, got);
-                            });
+    read_some(asio::buffer(in_header_ + header_got_, sizeof in_header_ - header_got_),
+              [self = shared_from_this()](const asio::error_code &ec, size_t got) { self->on_header_bytes(ec, got); });
 }
 
 void Session::on_header()
@@ -535,28 +552,28 @@ void Session::on_header()
         call();
         return;
     }
-    // The body's room is taken once its first byte is there, not on the
+    // The body's room is taken once its first bytes are in, not on the
     // header's word alone.
-    asio::error_code ec;
-    if (socket_.available(ec) > 0 && !ec) {
-        take_body();
-        return;
-    }
-    socket_.async_wait(tcp::socket::wait_read, [self = shared_from_this()](const asio::error_code &ec) {
-        if (ec)
-            self->close();
-        else
-            self->take_body();
-    });
+    const size_t first = std::min<size_t>(first_body_bytes_.size(), request_.body_len);
+    read_some(asio::buffer(first_body_bytes_.data(), first),
+              [self = shared_from_this()](const asio::error_code &ec, size_t got) {
+                  self->on_first_body_bytes(ec, got);
+              });
 }
 
-void Session::take_body()
+void Session::on_first_body_bytes(const asio::error_code &ec, size_t got)
 {
+    if (ec) {
+        close();
+        return;
+    }
     request_pkt_ = allocate_packet(request_.body_len);
-    if (request_pkt_ == nullptr)
+    if (request_pkt_ == nullptr) {
         send_fault(request_.call_id, rpc__s_no_memory);
-    else
-        read_body();
+        return;
+    }
+    std::memcpy(static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS, first_body_bytes_.data(), got);
+    on_body_bytes(ec, got);
 }
 
 // Takes what has arrived of the body now, and waits for the rest. The bytes
@@ -564,16 +581,51 @@ void Session::take_body()
 void Session::read_body()
 {
     auto *body = static_cast<unsigned char *>(request_pkt_.get()) + RPC_DATA_OFFS;
-    asio::error_code now;
-    const size_t got = socket_.read_some(asio::buffer(body + body_got_, request_.body_len - body_got_), now);
-    if (now == asio::error::would_block) {
-        socket_.async_read_some(asio::buffer(body + body_got_, request_.body_len - body_got_),
-                                [self = shared_from_this()](const asio::error_code &ec, size_t got) {
-                                    self->on_body_bytes(ec, got);
-                                });
+    read_some(asio::buffer(body + body_got_, request_.body_len - body_got_),
+              [self = shared_from_this()](const asio::error_code &ec, size_t got) { self->on_body_bytes(ec, got); });
+}
+
+template <class Done>
+void Session::read_some(asio::mutable_buffer buffer, Done done)
+{
+    if (tls_ != nullptr) {
+        tls_->async_read_some(buffer, std::move(done));
         return;
     }
-    on_body_bytes(now, got);
+    asio::error_code now;
+    const size_t got = socket_.read_some(buffer, now);
+    if (now == asio::error::would_block)
+        socket_.async_read_some(buffer, std::move(done));
+    else
+        done(now, got);
+}
+
+// A TLS server speaks TLS only. A client that starts a plain frame (its
+// first byte is the frame's, where TLS begins with a handshake record) is
+// told so in a plain fault, instead of a handshake it can't read.
+void Session::start_tls()
+{
+    socket_.async_wait(tcp::socket::wait_read, [self = shared_from_this()](const asio::error_code &ec) {
+        unsigned char first = 0;
+        asio::error_code peek;
+        if (ec || self->socket_.receive(asio::buffer(&first, 1), tcp::socket::message_peek, peek) != 1) {
+            self->close();
+            return;
+        }
+        if (first == ncs::frame::kMagic >> 24) {
+            self->refuse(rpc__s_tls_required);
+            return;
+        }
+        self->tls_ = std::make_unique<asio::ssl::stream<tcp::socket &>>(self->socket_, *self->tls_context_);
+        self->tls_->async_handshake(asio::ssl::stream_base::server, [self](const asio::error_code &ec) {
+            if (ec) {
+                self->close();
+                return;
+            }
+            self->in_frame_ = false;
+            self->read_header();
+        });
+    });
 }
 
 void Session::on_body_bytes(const asio::error_code &ec, size_t got)
@@ -670,6 +722,13 @@ void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
 {
     in_call_ = !closing;
     touch();
+    auto sent_all = [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
+        self->on_sent(ec, closing);
+    };
+    if (tls_ != nullptr) {
+        asio::async_write(*tls_, buffers, ncs::net::whole, std::move(sent_all));
+        return;
+    }
     // What the socket buffer takes goes now; the rest is waited for.
     asio::error_code now;
     const size_t sent = asio::write(socket_, buffers, ncs::net::whole, now);
@@ -679,10 +738,7 @@ void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
     }
     const size_t header_sent = std::min(sent, buffers[0].size());
     const std::array<asio::const_buffer, 2> rest = {buffers[0] + header_sent, buffers[1] + (sent - header_sent)};
-    asio::async_write(socket_, rest, ncs::net::whole,
-                      [self = shared_from_this(), closing](const asio::error_code &ec, size_t) {
-                          self->on_sent(ec, closing);
-                      });
+    asio::async_write(socket_, rest, ncs::net::whole, std::move(sent_all));
 }
 
 void Session::on_sent(const asio::error_code &ec, bool closing)

@@ -44,6 +44,16 @@ extern "C" {
 NCS_API void rpc__listen(const char *host, uint32_t port, uint32_t threads, socket__addr_t *bound,
                          uint32_t *bound_len, uint32_t *status);
 
+/* Turns TLS on for the server's connections: `cert` (a PEM chain), `key`
+ * and `ca` (the CA whose certificates clients must present). Called before
+ * rpc__listen, and again to reload the files: connections accepted from
+ * then on use the new ones, those already open keep theirs. All three null
+ * turns TLS off. Statuses: rpc__s_tls_key_exposed (the key file is readable
+ * by others), rpc__s_tls_settings (a file is missing or unusable, or not all
+ * three are given); the TLS in force is unchanged then. With TLS on, a plain
+ * client is answered rpc__s_tls_required and closed. */
+NCS_API void rpc__tls_server(const char *cert, const char *key, const char *ca, uint32_t *status);
+
 /* Stops the server: no further connection is accepted, connections that
  * wait for a request are closed, calls under way run to their end and send
  * their replies, then every thread of the server is joined. A call whose

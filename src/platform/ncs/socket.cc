@@ -1,5 +1,6 @@
 // Host names and socket addresses.
 #include "ncs/ncs.h"
+#include "ncs/tls.h"
 
 #include <netdb.h>
 
@@ -92,6 +93,11 @@ void socket__from_name(uint32_t family, const char *name, uint32_t name_len, uin
         return;
     std::memcpy(addr->bytes, result.bytes, first.ai_addrlen);
     *addr_len = static_cast<uint32_t>(first.ai_addrlen);
+    try {
+        ncs::tls::remember_name(result, host);
+    } catch (...) {
+        // Without the name, TLS checks the server's certificate against its address.
+    }
     set_status(status, rpc__s_ok);
 }
 

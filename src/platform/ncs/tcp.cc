@@ -19,6 +19,7 @@
 #include "ncs/frame.h"
 #include "ncs/net.h"
 #include "ncs/runtime.h"
+#include "ncs/tls.h"
 
 #include <array>
 #include <atomic>
@@ -45,9 +46,11 @@ constexpr uint32_t kDefaultClientIdleS = 60;
     EXC1__Raise(EXC1_Thread(), status);
 }
 
-// The communication status of a failed socket operation.
+// The communication status of a failed socket or TLS operation.
 uint32_t status_of(const asio::error_code &ec)
 {
+    if (ec.category() == asio::error::get_ssl_category() || ec == asio::ssl::error::stream_truncated)
+        return ncs::tls::status_of(ec);
     if (ec == asio::error::connection_refused)
         return rpc__s_connect_refused;
     if (ec == asio::error::connection_reset || ec == asio::error::broken_pipe ||
@@ -84,9 +87,26 @@ public:
 
     const std::string &key() const { return key_; }
     Clock::time_point idle_since() const { return idle_since_; }
-    void mark_idle() { idle_since_ = Clock::now(); }
+    void mark_idle()
+    {
+        idle_since_ = Clock::now();
+        served_ = true;
+    }
 
-    asio::error_code connect(const tcp::endpoint &endpoint, Clock::time_point deadline)
+    // The status of a failed operation. A TLS 1.3 server checks the client's
+    // certificate after the client's handshake is done: its refusal ends the
+    // first exchange of a new connection, as an alert or a closed or reset
+    // connection, and is reported as the handshake's failure.
+    uint32_t failure(const asio::error_code &ec) const
+    {
+        if (tls_ != nullptr && !served_ && ec != asio::error::timed_out)
+            return ncs::tls::status_of(ec);
+        return status_of(ec);
+    }
+
+    // Connects, and with `tls` shakes hands as its client before the deadline.
+    asio::error_code connect(const tcp::endpoint &endpoint, const std::shared_ptr<ncs::tls::Context> &tls,
+                             Clock::time_point deadline)
     {
         asio::error_code ec;
         socket_.open(endpoint.protocol(), ec);
@@ -96,7 +116,13 @@ public:
         socket_.set_option(tcp::no_delay(true), ec);
         socket_.set_option(asio::socket_base::send_buffer_size(ncs::net::kSocketBuffer), ec);
         socket_.set_option(asio::socket_base::receive_buffer_size(ncs::net::kSocketBuffer), ec);
-        return run(deadline, [&](auto done) { socket_.async_connect(endpoint, done); });
+        ec = run(deadline, [&](auto done) { socket_.async_connect(endpoint, done); });
+        if (ec || tls == nullptr)
+            return ec;
+        tls_context_ = tls;
+        tls_ = std::make_unique<asio::ssl::stream<tcp::socket &>>(socket_, *tls);
+        ncs::tls::expect_server(*tls_, endpoint.address());
+        return run(deadline, [&](auto done) { tls_->async_handshake(asio::ssl::stream_base::client, done); });
     }
 
     // Whether an idle connection is still open at the server's end: the
@@ -114,12 +140,22 @@ public:
 
     asio::error_code write(const std::array<asio::const_buffer, 2> &buffers, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) { asio::async_write(socket_, buffers, ncs::net::whole, done); });
+        return run(deadline, [&](auto done) {
+            if (tls_ != nullptr)
+                asio::async_write(*tls_, buffers, ncs::net::whole, done);
+            else
+                asio::async_write(socket_, buffers, ncs::net::whole, done);
+        });
     }
 
     asio::error_code read(asio::mutable_buffer buffer, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) { asio::async_read(socket_, buffer, ncs::net::whole, done); });
+        return run(deadline, [&](auto done) {
+            if (tls_ != nullptr)
+                asio::async_read(*tls_, buffer, ncs::net::whole, done);
+            else
+                asio::async_read(socket_, buffer, ncs::net::whole, done);
+        });
     }
 
 private:
@@ -144,8 +180,11 @@ private:
 
     asio::io_context io_{1};
     tcp::socket socket_{io_};
+    std::shared_ptr<ncs::tls::Context> tls_context_;  // outlives tls_
+    std::unique_ptr<asio::ssl::stream<tcp::socket &>> tls_;
     std::string key_;
     Clock::time_point idle_since_{};
+    bool served_ = false;  // an exchange has gone through since the connect
 };
 
 // Idle connections, newest last. A connection idle for longer than the
@@ -249,12 +288,12 @@ Exchange exchange(Connection &connection, const std::array<asio::const_buffer, 2
         Clock::now() + std::chrono::milliseconds(ncs::setting("NCS_CALL_TIMEOUT_MS", kDefaultCallTimeoutMs));
     asio::error_code ec = connection.write(request, deadline);
     if (ec)
-        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kNotSent, status_of(ec)};
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kNotSent, connection.failure(ec)};
 
     ncs::frame::Bytes bytes;
     ec = connection.read(asio::buffer(bytes), deadline);
     if (ec)
-        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, status_of(ec)};
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, connection.failure(ec)};
     ncs::frame::Header header;
     if (!ncs::frame::decode(bytes, header) || header.kind == ncs::frame::kRequest)
         return {Ending::kBroken, rpc__s_protocol_error};
@@ -278,20 +317,21 @@ Exchange exchange(Connection &connection, const std::array<asio::const_buffer, 2
         if (reply.must_free)
             rpc__free_pkt(reply.pkt);
         reply = ncs::Reply{};
-        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, status_of(ec)};
+        return {ec == asio::error::timed_out ? Ending::kBroken : Ending::kLost, connection.failure(ec)};
     }
     reply.drep = header.drep;
     return {Ending::kReply, rpc__s_ok, keep};
 }
 
-std::unique_ptr<Connection> open_connection(const std::string &key, const socket__addr_t &addr)
+std::unique_ptr<Connection> open_connection(const std::string &key, const socket__addr_t &addr,
+                                            const std::shared_ptr<ncs::tls::Context> &tls)
 {
     auto connection = std::make_unique<Connection>(key);
     Clock::time_point deadline =
         Clock::now() + std::chrono::milliseconds(ncs::setting("NCS_CONNECT_TIMEOUT_MS", kDefaultConnectTimeoutMs));
-    asio::error_code ec = connection->connect(ncs::net::endpoint_of(addr), deadline);
+    asio::error_code ec = connection->connect(ncs::net::endpoint_of(addr), tls, deadline);
     if (ec)
-        raise(status_of(ec));
+        raise(ec == asio::error::timed_out || tls == nullptr ? status_of(ec) : ncs::tls::status_of(ec));
     return connection;
 }
 
@@ -316,7 +356,12 @@ public:
             asio::buffer(bytes), asio::buffer(static_cast<const unsigned char *>(request_pkt) + RPC_DATA_OFFS,
                                               request_len)};
         bool idempotent = (options & RPC_OPT_IDEMPOTENT) != 0;
-        std::string key = pool_key(addr);
+        uint32_t status;
+        std::shared_ptr<ncs::tls::Context> tls = ncs::tls::client_context(status);
+        if (status != rpc__s_ok)
+            raise(status);
+        // Connections of other TLS settings, or none, are not this call's.
+        std::string key = pool_key(addr) + std::to_string(reinterpret_cast<uintptr_t>(tls.get()));
 
         for (bool first = true;; first = false) {
             // A repeat goes on a new connection: the other idle ones may be
@@ -324,7 +369,7 @@ public:
             std::unique_ptr<Connection> connection = first ? pool().take(key) : nullptr;
             bool pooled = connection != nullptr;
             if (!pooled)
-                connection = open_connection(key, addr);
+                connection = open_connection(key, addr, tls);
             Exchange result = exchange(*connection, request, header.call_id, reply_buf, reply_buf_size, reply);
             switch (result.ending) {
             case Ending::kReply:

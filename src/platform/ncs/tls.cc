@@ -1,0 +1,176 @@
+// TLS contexts of the carrier's two ends, and the names the client checks.
+#include "ncs/tls.h"
+
+#include "ncs/net.h"
+#include "ncs/server.h"
+#include "plt/plt1.h"
+#include "trc/trc1.h"
+
+#include <openssl/ssl.h>
+#include <sys/stat.h>
+
+#include <map>
+#include <mutex>
+
+TRC1_DEFINE_UNIT("tls");
+
+namespace ncs::tls {
+
+namespace {
+
+constexpr size_t kMaxNames = 256;
+
+struct Files {
+    std::string cert, key, ca;
+    bool operator==(const Files &) const = default;
+    bool off() const { return cert.empty() && key.empty() && ca.empty(); }
+};
+
+// A context of `files` for one end, or null with `error` saying why.
+// A client may go without a certificate of its own (a server that wants one
+// refuses it then); a server may not.
+std::shared_ptr<Context> make_context(const Files &files, bool server, std::string &error, bool &exposed)
+{
+    exposed = false;
+    const bool own = !files.cert.empty() || !files.key.empty();
+    if (files.ca.empty() || files.cert.empty() != files.key.empty() || (server && !own)) {
+        error = server ? "TLS needs a certificate, its key and a CA, all three"
+                       : "TLS needs a CA, and a certificate with its key or neither";
+        return nullptr;
+    }
+    auto context = std::make_shared<Context>(server ? Context::tls_server : Context::tls_client);
+    SSL_CTX *native = context->native_handle();
+    SSL_CTX_set_min_proto_version(native, TLS1_3_VERSION);
+    if (server)
+        SSL_CTX_set_num_tickets(native, 0);
+    asio::error_code ec;
+    context->load_verify_file(files.ca, ec);
+    if (!ec)
+        context->set_verify_mode(asio::ssl::verify_peer | asio::ssl::verify_fail_if_no_peer_cert, ec);
+    if (ec) {
+        error = "can't use the CA file " + files.ca + ": " + ec.message();
+        return nullptr;
+    }
+    if (!own)
+        return context;
+    struct stat key_stat;
+    if (::stat(files.key.c_str(), &key_stat) != 0) {
+        error = "can't read the key file " + files.key;
+        return nullptr;
+    }
+    if ((key_stat.st_mode & (S_IROTH | S_IWOTH)) != 0) {
+        error = "the key file " + files.key + " is readable by others (chmod o-rwx)";
+        exposed = true;
+        return nullptr;
+    }
+    std::string file = files.cert;
+    context->use_certificate_chain_file(files.cert, ec);
+    if (!ec) {
+        file = files.key;
+        context->use_private_key_file(files.key, Context::pem, ec);
+    }
+    if (ec) {
+        error = "can't use " + file + ": " + ec.message();
+        return nullptr;
+    }
+    return context;
+}
+
+std::mutex g_mutex;  // guards the members below
+Files g_client_files;
+std::shared_ptr<Context> g_client;
+std::shared_ptr<Context> g_server;
+std::map<std::string, std::string> g_names;  // host names by address
+
+}  // namespace
+
+std::shared_ptr<Context> client_context(uint32_t &status)
+{
+    TRC1_FUNCTION();
+    Files files{PLT1_GetEnv("NCS_TLS_CERT", ""), PLT1_GetEnv("NCS_TLS_KEY", ""), PLT1_GetEnv("NCS_TLS_CA", "")};
+    status = rpc__s_ok;
+    if (files.off())
+        return nullptr;
+    std::lock_guard<std::mutex> hold(g_mutex);
+    if (g_client != nullptr && files == g_client_files)
+        return g_client;
+    std::string error;
+    bool exposed;
+    std::shared_ptr<Context> context = make_context(files, false, error, exposed);
+    if (context == nullptr) {
+        TRC1_ERROR_MSG("TLS settings of the client refused: %s", error.c_str());
+        status = exposed ? rpc__s_tls_key_exposed : rpc__s_tls_settings;
+        return nullptr;
+    }
+    g_client_files = files;
+    g_client = context;
+    return context;
+}
+
+std::shared_ptr<Context> server_context()
+{
+    std::lock_guard<std::mutex> hold(g_mutex);
+    return g_server;
+}
+
+void expect_server(asio::ssl::stream<asio::ip::tcp::socket &> &stream, const asio::ip::address &address)
+{
+    std::string name = address.to_string();
+    {
+        std::lock_guard<std::mutex> hold(g_mutex);
+        auto known = g_names.find(name);
+        if (known != g_names.end())
+            name = known->second;
+    }
+    asio::error_code literal;
+    asio::ip::make_address(name, literal);
+    if (literal)
+        SSL_set_tlsext_host_name(stream.native_handle(), name.c_str());
+    stream.set_verify_callback(asio::ssl::host_name_verification(name));
+}
+
+void remember_name(const socket__addr_t &addr, const std::string &host)
+{
+    const std::string address = net::endpoint_of(addr).address().to_string();
+    std::lock_guard<std::mutex> hold(g_mutex);
+    if (g_names.size() >= kMaxNames && g_names.count(address) == 0)
+        g_names.erase(g_names.begin());
+    g_names[address] = host;
+}
+
+uint32_t status_of(const asio::error_code &ec)
+{
+    if (ec.category() == asio::error::get_ssl_category() &&
+        ERR_GET_REASON(static_cast<unsigned long>(ec.value())) == SSL_R_CERTIFICATE_VERIFY_FAILED)
+        return rpc__s_tls_untrusted;
+    return rpc__s_tls_handshake;
+}
+
+}  // namespace ncs::tls
+
+extern "C" {
+
+void rpc__tls_server(const char *cert, const char *key, const char *ca, uint32_t *status)
+{
+    TRC1_FUNCTION();
+    uint32_t result = rpc__s_ok;
+    try {
+        ncs::tls::Files files{cert != nullptr ? cert : "", key != nullptr ? key : "", ca != nullptr ? ca : ""};
+        std::shared_ptr<ncs::tls::Context> context;
+        std::string error;
+        bool exposed = false;
+        if (!files.off() && (context = ncs::tls::make_context(files, true, error, exposed)) == nullptr) {
+            TRC1_ERROR_MSG("TLS settings of the server refused: %s", error.c_str());
+            result = exposed ? rpc__s_tls_key_exposed : rpc__s_tls_settings;
+        } else {
+            std::lock_guard<std::mutex> hold(ncs::tls::g_mutex);
+            ncs::tls::g_server = std::move(context);
+        }
+    } catch (...) {
+        result = rpc__s_tls_settings;
+    }
+    if (status != nullptr)
+        *status = result;
+}
+
+}  // extern "C"
