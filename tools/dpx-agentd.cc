@@ -1,6 +1,7 @@
 // dpx-agentd: hosts libdpx as a service. Brings up the RPC server on an
 // address, starts the library, serves the depot until SIGTERM or SIGINT.
 #include "dpx/dpx.h"
+#include "rights.h"
 
 #include "afw/afw.h"
 #include "ncs/lb.h"
@@ -12,6 +13,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <future>
+#include <optional>
 #include <pthread.h>
 #include <string>
 #include <thread>
@@ -21,7 +23,7 @@ namespace {
 const char kUsage[] =
     "usage: dpx-agentd --depot DIR --product NAME [--listen HOST:PORT] [--threads N] [--hub]\n"
     "                  [--advertise HOST:PORT] [--renew SECONDS] [--broker] [--confine]\n"
-    "                  [--read-only] [--tls-cert FILE --tls-key FILE --tls-ca FILE]\n"
+    "                  [--read-only] [--tls-cert FILE --tls-key FILE --tls-ca FILE [--rights FILE]]\n"
     "\n"
     "Serves the depot DIR/NAME to clients of the file transfer interface.\n"
     "\n"
@@ -49,6 +51,9 @@ const char kUsage[] =
     "  --tls-ca FILE       and the CA whose certificates clients must present; plain\n"
     "                      clients are refused. SIGHUP reloads the three files: new\n"
     "                      connections use them, open ones keep theirs\n"
+    "  --rights FILE       with TLS: what each client may do, by its certificate's name:\n"
+    "                      lines \"NAME read|write|read,write NODES PATHS\" (see the README);\n"
+    "                      a call beyond them is declined (0xF11E0011)\n"
     "  --help              this text\n"
     "\n"
     "When ready it prints one line \"listening on HOST:PORT\" on standard output.\n"
@@ -85,6 +90,7 @@ struct Options {
     bool confine = false;
     bool read_only = false;
     std::string tls_cert, tls_key, tls_ca;  // all empty: plain TCP
+    std::string rights;                     // empty: every client may do everything
 };
 
 // The managers that answer while every thread that runs calls is busy: busy,
@@ -111,22 +117,68 @@ const dpx_transfer_v1_epv_t kBusyManagers = {busy_get_chunks, busy_put_chunks, b
 
 // The managers the daemon registers: the library's, behind its rights. A
 // refused call is answered "request declined" (DPX_E_QUIET): the client
-// neither retries it nor drops its binding.
-bool g_read_only = false;  // set once before the server takes calls
+// neither retries it nor drops its binding. Both are set once, before the
+// server takes calls.
+bool g_read_only = false;
+std::optional<dpxtools::Rights> g_rights;
 
+// Whether the client of `handle` may have `access` to `desc` (null: to no
+// file); a refusal is logged with the client's name.
+bool allowed(handle_t handle, int access, const dpx_file_desc *desc, const char *operation)
+{
+    const bool writing = (access & dpxtools::Rights::kWrite) != 0;
+    char name[256] = "";
+    uint32_t status;
+    rpc__inq_client_name(handle, name, sizeof name, &status);
+    const char *why = nullptr;
+    if (writing && g_read_only)
+        why = "read-only";
+    else if (g_rights && !g_rights->allows(name, access, desc != nullptr ? desc->node : nullptr, sizeof desc->node,
+                                           desc != nullptr ? desc->path : nullptr, sizeof desc->path))
+        why = "not in the rights";
+    if (why == nullptr)
+        return true;
+    std::fprintf(stderr, "dpx-agentd: %s of \"%.*s\" on \"%.*s\" by \"%s\" refused: %s\n", operation,
+                 desc != nullptr ? static_cast<int>(strnlen(desc->path, sizeof desc->path)) : 0,
+                 desc != nullptr ? desc->path : "", desc != nullptr ? static_cast<int>(strnlen(desc->node, sizeof desc->node)) : 0,
+                 desc != nullptr ? desc->node : "", name, why);
+    return false;
+}
+
+void guarded_get_chunks(handle_t handle, dpx_file_desc *desc, uint32_t *crc, uint8_t *state, uint32_t *index,
+                        int16_t *last, int16_t max, dpx_status *status, dpx_chunk *buffer)
+{
+    if (allowed(handle, dpxtools::Rights::kRead, desc, "get"))
+        dpx_get_chunks(handle, desc, crc, state, index, last, max, status, buffer);
+    else
+        *status = DPX_E_QUIET;
+}
 void guarded_put_chunks(handle_t handle, dpx_file_desc desc, uint32_t crc, uint8_t state, int16_t *last,
                         int16_t max, dpx_status *status, dpx_chunk *buffer)
 {
-    if (g_read_only) {
-        std::fprintf(stderr, "dpx-agentd: put of %.*s refused: read-only\n", static_cast<int>(sizeof desc.path),
-                     desc.path);
+    if (allowed(handle, dpxtools::Rights::kWrite, &desc, "put"))
+        dpx_put_chunks(handle, desc, crc, state, last, max, status, buffer);
+    else
         *status = DPX_E_QUIET;
-        return;
-    }
-    dpx_put_chunks(handle, desc, crc, state, last, max, status, buffer);
 }
-const dpx_transfer_v1_epv_t kGuardedManagers = {dpx_get_chunks, guarded_put_chunks, dpx_agent_query,
-                                                dpx_list_nodes};
+void guarded_agent_query(handle_t handle, dpx_query_text query, dpx_file_desc desc, uint32_t *result,
+                         dpx_status *status)
+{
+    if (allowed(handle, dpxtools::Rights::kRead, &desc, "query"))
+        dpx_agent_query(handle, query, desc, result, status);
+    else
+        *status = DPX_E_QUIET;
+}
+void guarded_list_nodes(handle_t handle, dpx_node_filter filter, int16_t *last, int16_t max, dpx_status *status,
+                        dpx_node_name *nodes)
+{
+    if (allowed(handle, dpxtools::Rights::kRead, nullptr, "list"))
+        dpx_list_nodes(handle, filter, last, max, status, nodes);
+    else
+        *status = DPX_E_QUIET;
+}
+const dpx_transfer_v1_epv_t kGuardedManagers = {guarded_get_chunks, guarded_put_chunks, guarded_agent_query,
+                                                guarded_list_nodes};
 
 // How long a stop waits for calls under way before the process ends without them.
 constexpr auto kStopGrace = std::chrono::seconds(5);
@@ -218,11 +270,14 @@ int main(int argc, char **argv)
             options.confine = true;
         } else if (arg == "--read-only") {
             options.read_only = true;
-        } else if (arg == "--tls-cert" || arg == "--tls-key" || arg == "--tls-ca") {
+        } else if (arg == "--tls-cert" || arg == "--tls-key" || arg == "--tls-ca" || arg == "--rights") {
             const char *v = value(arg.c_str());
             if (v == nullptr)
                 return 2;
-            (arg == "--tls-cert" ? options.tls_cert : arg == "--tls-key" ? options.tls_key : options.tls_ca) = v;
+            (arg == "--tls-cert" ? options.tls_cert
+             : arg == "--tls-key" ? options.tls_key
+             : arg == "--tls-ca"  ? options.tls_ca
+                                  : options.rights) = v;
         } else {
             return usage_error(("unknown argument " + arg).c_str());
         }
@@ -234,6 +289,16 @@ int main(int argc, char **argv)
     const bool tls = !options.tls_cert.empty() || !options.tls_key.empty() || !options.tls_ca.empty();
     if (tls && (options.tls_cert.empty() || options.tls_key.empty() || options.tls_ca.empty()))
         return usage_error("--tls-cert, --tls-key and --tls-ca go together");
+    if (!options.rights.empty()) {
+        if (!tls)
+            return usage_error("--rights goes with TLS: clients are known by their certificates");
+        std::string error;
+        g_rights = dpxtools::Rights::load(options.rights, error);
+        if (!g_rights) {
+            std::fprintf(stderr, "dpx-agentd: %s\n", error.c_str());
+            return 1;
+        }
+    }
 
     // The signals are taken by the wait below; every thread inherits the mask.
     sigset_t stop_signals;

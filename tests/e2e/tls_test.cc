@@ -34,8 +34,9 @@ public:
                  key(id), "-out", pem(id), "-days", "30", "-subj", "/CN=" + name});
         return id;
     }
-    std::string pem(const std::string &name) const { return dir_ / (name + ".pem"); }
-    std::string key(const std::string &name) const { return dir_ / (name + ".key"); }
+    std::string file(const std::string &name) const { return dir_ / name; }
+    std::string pem(const std::string &name) const { return file(name + ".pem"); }
+    std::string key(const std::string &name) const { return file(name + ".key"); }
     // The client's environment for certificate `name` ("" for none) and CA `ca`.
     Env client(const std::string &name, const std::string &ca = "ca") const
     {
@@ -70,8 +71,15 @@ protected:
             GTEST_SKIP() << "needs openssl";
         certs.issue("server", "DNS:localhost,IP:127.0.0.1");
         certs.issue("client", "DNS:client");
-        hub = std::make_unique<Hub>(std::vector<std::string>{
-            "--tls-cert", certs.pem("server"), "--tls-key", certs.key("server"), "--tls-ca", certs.pem("ca")});
+        start({});
+    }
+    void start(std::vector<std::string> more)
+    {
+        hub.reset();
+        std::vector<std::string> args = {"--tls-cert", certs.pem("server"), "--tls-key", certs.key("server"),
+                                         "--tls-ca", certs.pem("ca")};
+        args.insert(args.end(), more.begin(), more.end());
+        hub = std::make_unique<Hub>(args);
     }
     Certificates certs;
     std::unique_ptr<Hub> hub;
@@ -145,6 +153,39 @@ TEST_F(Tls, SighupReloadsTheFilesForNewConnectionsWithoutDroppingACallUnderWay)
     EXPECT_TRUE(same_files(hub->depot_file("big.bin"), *hub / "big.bin"));
     Ran after = dpx(certs.client("client"), {"get", "node1", "big.bin", *hub / "again.bin"});
     EXPECT_EQ(after.err.substr(0, 10), "0x1C010010") << after.err;
+}
+
+TEST_F(Tls, TheRightsFileDeclinesWhatItDoesNotGrantByTheCertificatesName)
+{
+    certs.issue("reader", "DNS:reader");
+    write_file(certs.file("rights"), "# NAME RIGHTS NODES PATHS\n"
+                               "client  read,write  node1,node2  conf/ notes.txt\n"
+                               "reader  read        *            *\n");
+    start({"--rights", certs.file("rights")});
+    made_dir(hub->depot_file("secret"));
+    write_file(hub->depot_file("secret/key"), "secret");
+    write_file(*hub / "new.cfg", "new");
+    const struct { const char *who, *op, *node, *path; bool allowed; } calls[] = {
+        {"client", "put", "node1", "conf/app.cfg", true},
+        {"client", "put", "node2", "./conf/../notes.txt", true},
+        {"client", "get", "node1", "conf/app.cfg", true},
+        {"client", "put", "node3", "conf/app.cfg", false},
+        {"client", "put", "node1", "conf/../secret/key", false},
+        {"client", "get", "node1", "secret/key", false},
+        {"client", "put", "node1", "notes.txt.d/x", false},
+        {"reader", "get", "node9", "secret/key", true},
+        {"reader", "put", "node1", "conf/app.cfg", false},
+    };
+    for (const auto &c : calls) {
+        SCOPED_TRACE(std::string(c.who) + " " + c.op + " " + c.node + " " + c.path);
+        Ran ran = dpx(certs.client(c.who), {c.op, c.node, c.path, *hub / (std::string(c.op) == "put" ? "new.cfg" : "got")});
+        EXPECT_TRUE(exited_with(ran.wstatus, c.allowed ? 0 : 1)) << ran.err;
+        if (!c.allowed) {
+            EXPECT_EQ(ran.err.substr(0, 10), "0xF11E0011") << ran.err;
+        }
+        EXPECT_EQ(read_file(hub->depot_file("secret/key")), "secret");
+    }
+    EXPECT_EQ(read_file(hub->depot_file("conf/app.cfg")), "new");
 }
 
 TEST(Rights, AReadOnlyDaemonDeclinesEveryPutAndLeavesTheDepotAsItWas)

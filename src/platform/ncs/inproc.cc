@@ -19,7 +19,7 @@ public:
         void *out_pkt = offer ? reply_buf : nullptr;
         uint32_t out_max = offer ? reply_buf_size - RPC_DATA_OFFS : 0;
         ncs::Dispatched outcome = ncs::dispatch(ifspec.id, ifspec.vers, opnum, NCS_DREP_LOCAL, request_pkt,
-                                                request_len, out_pkt, out_max, false);
+                                                request_len, out_pkt, out_max, false, nullptr);
         if (outcome.fault != rpc__s_ok)
             EXC1__Raise(EXC1_Thread(), outcome.fault);
 

@@ -6,9 +6,11 @@
 // so an interface unregistered while its calls run is gone for new calls at
 // once, and the calls under way finish on the registration they started with.
 #include "ncs/runtime.h"
+#include "ncs/server.h"
 
 #include <array>
 #include <atomic>
+#include <cstdio>
 #include <cstring>
 #include <map>
 #include <memory>
@@ -93,7 +95,7 @@ void drop_reply(const ncs::Dispatched &outcome)
 namespace ncs {
 
 Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint32_t drep, void *in_pkt,
-                    uint32_t in_len, void *out_pkt, uint32_t out_max, bool busy)
+                    uint32_t in_len, void *out_pkt, uint32_t out_max, bool busy, const char *client)
 {
     Dispatched outcome;
     std::shared_ptr<const Registration> registration = registry().find(if_id, if_vers);
@@ -116,6 +118,7 @@ Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint
     Handle server_handle{};
     server_handle.data_offs = RPC_DATA_OFFS;
     server_handle.magic = kHandleMagic;
+    server_handle.client_name = client;
 
     uint32_t call_drep = drep;
     unsigned char must_free = 0;
@@ -178,6 +181,18 @@ void rpc__register_busy_mgr(const rpc__if_spec_t *ifspec, const void *busy_mgr_e
         return;
     }
     registration->busy_mgr_epv = busy_mgr_epv;
+    set_status(status, rpc__s_ok);
+}
+
+void rpc__inq_client_name(handle_t handle, char *name, size_t size, uint32_t *status)
+{
+    const auto *h = reinterpret_cast<const ncs::Handle *>(handle);
+    if (h == nullptr || h->magic != ncs::kHandleMagic || name == nullptr || size == 0) {
+        set_status(status, rpc__s_invalid_handle);
+        return;
+    }
+    const char *client = h->client_name != nullptr ? h->client_name : "";
+    std::snprintf(name, size, "%s", client);
     set_status(status, rpc__s_ok);
 }
 

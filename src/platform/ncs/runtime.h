@@ -15,6 +15,7 @@ struct Handle : rpc__handle_rec {
     bool bound;               // false after rpc__clear_server_binding
     socket__addr_t addr;
     uint32_t addr_len;
+    const char *client_name;  // of a server's handle: the TLS client's name, or null
 };
 constexpr uint32_t kHandleMagic = 0x48414e44;  // "HAND"
 
@@ -75,13 +76,14 @@ struct Dispatched {
 
 // Runs the server stub registered for (interface UUID, version, operation)
 // on the request body at in_pkt + RPC_DATA_OFFS, offering out_pkt with
-// out_max bytes of room behind RPC_DATA_OFFS for the reply. With `busy`, the
+// out_max bytes of room behind RPC_DATA_OFFS for the reply. `client` is the
+// name in the TLS client's certificate, or null. With `busy`, the
 // stub calls the interface's busy managers instead of its managers, and an
 // interface without them gives the fault rpc__s_server_busy. An unknown
 // interface gives fault rpc__s_unknown_if, an operation outside the
 // interface's count rpc__s_op_rng_error. Never throws.
 Dispatched dispatch(const uuid__t &if_id, uint32_t if_vers, uint32_t opnum, uint32_t drep, void *in_pkt,
-                    uint32_t in_len, void *out_pkt, uint32_t out_max, bool busy);
+                    uint32_t in_len, void *out_pkt, uint32_t out_max, bool busy, const char *client);
 
 }  // namespace ncs
 

@@ -228,6 +228,7 @@ private:
     void send(std::array<asio::const_buffer, 2> buffers, bool closing);
     void on_sent(const asio::error_code &ec, bool closing);
     void touch() { waiting_since_ = Clock::now(); }
+    const char *client_name() const { return tls_ != nullptr ? client_name_.c_str() : nullptr; }
     void arm_timer();
     void release_body();
     void close()
@@ -244,6 +245,7 @@ private:
     const std::string peer_;          // the peer's address, which its connection count goes by
     std::shared_ptr<ncs::tls::Context> tls_context_;  // null for plain TCP; outlives tls_
     std::unique_ptr<asio::ssl::stream<tcp::socket &>> tls_;
+    std::string client_name_;  // the common name of the TLS client's certificate
     std::array<unsigned char, 4096> first_body_bytes_;
     Clock::time_point waiting_since_;  // start of the present wait for the peer
     Clock::time_point frame_started_;  // first byte of the frame under way
@@ -623,6 +625,7 @@ void Session::start_tls()
                 return;
             }
             self->in_frame_ = false;
+            self->client_name_ = ncs::tls::client_name(*self->tls_);
             self->read_header();
         });
     });
@@ -663,7 +666,7 @@ void Session::call()
         ncs::Dispatched outcome = ncs::dispatch(
             session.request_.if_id, session.request_.if_vers, session.request_.opnum, session.request_.drep,
             session.request_pkt_.get(), session.request_.body_len, session.offered_pkt_.get(),
-            session.offered_pkt_ != nullptr ? kOfferedReply : 0, false);
+            session.offered_pkt_ != nullptr ? kOfferedReply : 0, false, session.client_name());
         session.server_.call_ends();
         asio::post(session.socket_.get_executor(), [self, outcome] { self->on_called(outcome); });
     };
@@ -671,7 +674,7 @@ void Session::call()
         return;
     on_called(ncs::dispatch(request_.if_id, request_.if_vers, request_.opnum, request_.drep, request_pkt_.get(),
                             request_.body_len, offered_pkt_.get(), offered_pkt_ != nullptr ? kOfferedReply : 0,
-                            true));
+                            true, client_name()));
 }
 
 void Session::on_called(const ncs::Dispatched &outcome)

@@ -129,6 +129,17 @@ void expect_server(asio::ssl::stream<asio::ip::tcp::socket &> &stream, const asi
     stream.set_verify_callback(asio::ssl::host_name_verification(name));
 }
 
+std::string client_name(asio::ssl::stream<asio::ip::tcp::socket &> &stream)
+{
+    X509 *certificate = SSL_get1_peer_certificate(stream.native_handle());
+    if (certificate == nullptr)
+        return "";
+    char name[256] = "";
+    X509_NAME_get_text_by_NID(X509_get_subject_name(certificate), NID_commonName, name, sizeof name);
+    X509_free(certificate);
+    return name;
+}
+
 void remember_name(const socket__addr_t &addr, const std::string &host)
 {
     const std::string address = net::endpoint_of(addr).address().to_string();

@@ -38,6 +38,10 @@ std::shared_ptr<Context> server_context();
 // Sets up `stream` to check the certificate of the server at `address`.
 void expect_server(asio::ssl::stream<asio::ip::tcp::socket &> &stream, const asio::ip::address &address);
 
+// The common name in the certificate of the peer of `stream`, after its
+// handshake; empty without one.
+std::string client_name(asio::ssl::stream<asio::ip::tcp::socket &> &stream);
+
 // Notes that `host` was looked up and gave the IPv4 or IPv6 `addr`, for the
 // check above.
 void remember_name(const socket__addr_t &addr, const std::string &host);
