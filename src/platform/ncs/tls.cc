@@ -41,6 +41,9 @@ std::shared_ptr<Context> make_context(const Files &files, bool server, std::stri
     auto context = std::make_shared<Context>(server ? Context::tls_server : Context::tls_client);
     SSL_CTX *native = context->native_handle();
     SSL_CTX_set_min_proto_version(native, TLS1_3_VERSION);
+    // AES-128-GCM first: the fastest of the three where the processor has AES
+    // instructions, and as strong as this use needs.
+    SSL_CTX_set_ciphersuites(native, "TLS_AES_128_GCM_SHA256:TLS_AES_256_GCM_SHA384:TLS_CHACHA20_POLY1305_SHA256");
     if (server)
         SSL_CTX_set_num_tickets(native, 0);
     asio::error_code ec;
