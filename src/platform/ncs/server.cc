@@ -69,6 +69,8 @@ constexpr auto kAcceptRetry = std::chrono::milliseconds(100);
 // Room for a reply body that the server offers every call: small replies
 // need no packet of their own.
 constexpr uint32_t kOfferedReply = 8192;
+// What one read of a TLS connection's socket takes at most.
+constexpr size_t kTlsReadChunk = 64 * 1024;
 
 struct PacketDeleter {
     void operator()(void *pkt) const { rpc__free_pkt(pkt); }
@@ -212,6 +214,10 @@ private:
     using Clock = asio::steady_timer::clock_type;
 
     void start_tls();
+    void shake_hands();
+    // Feeds tls_ what the socket has now, else waits for some; then `done`.
+    template <class Done>
+    void fill(Done done);
     // Reads some bytes: those already there at once on a plain connection,
     // else when they come. `done` gets the error and the count.
     template <class Done>
@@ -243,8 +249,10 @@ private:
     tcp::socket socket_;
     asio::steady_timer timer_;
     const std::string peer_;          // the peer's address, which its connection count goes by
-    std::shared_ptr<ncs::tls::Context> tls_context_;  // null for plain TCP; outlives tls_
-    std::unique_ptr<asio::ssl::stream<tcp::socket &>> tls_;
+    std::shared_ptr<ncs::tls::Context> tls_context_;  // null for plain TCP
+    std::unique_ptr<ncs::tls::Channel> tls_;          // once the peer has begun TLS
+    std::vector<unsigned char> incoming_;             // records read for tls_
+    size_t tls_sending_ = 0;                          // bytes of tls_'s records that a send carries
     std::string client_name_;  // the common name of the TLS client's certificate
     std::array<unsigned char, 4096> first_body_bytes_;
     Clock::time_point waiting_since_;  // start of the present wait for the peer
@@ -591,7 +599,18 @@ template <class Done>
 void Session::read_some(asio::mutable_buffer buffer, Done done)
 {
     if (tls_ != nullptr) {
-        tls_->async_read_some(buffer, std::move(done));
+        asio::error_code ec;
+        const size_t got = tls_->open(buffer, ec);
+        if (got > 0 || ec) {
+            done(ec, got);
+            return;
+        }
+        fill([self = shared_from_this(), buffer, done](const asio::error_code &ec) {
+            if (ec)
+                done(ec, 0);
+            else
+                self->read_some(buffer, done);
+        });
         return;
     }
     asio::error_code now;
@@ -600,6 +619,25 @@ void Session::read_some(asio::mutable_buffer buffer, Done done)
         socket_.async_read_some(buffer, std::move(done));
     else
         done(now, got);
+}
+
+template <class Done>
+void Session::fill(Done done)
+{
+    if (incoming_.empty())
+        incoming_.resize(kTlsReadChunk);
+    asio::error_code now;
+    const size_t got = socket_.read_some(asio::buffer(incoming_), now);
+    if (now != asio::error::would_block) {
+        tls_->feed(incoming_.data(), got);
+        done(now);
+        return;
+    }
+    socket_.async_read_some(asio::buffer(incoming_),
+                            [self = shared_from_this(), done](const asio::error_code &ec, size_t got) {
+                                self->tls_->feed(self->incoming_.data(), got);
+                                done(ec);
+                            });
 }
 
 // A TLS server speaks TLS only. A client that starts a plain frame (its
@@ -618,17 +656,38 @@ void Session::start_tls()
             self->refuse(rpc__s_tls_required);
             return;
         }
-        self->tls_ = std::make_unique<asio::ssl::stream<tcp::socket &>>(self->socket_, *self->tls_context_);
-        self->tls_->async_handshake(asio::ssl::stream_base::server, [self](const asio::error_code &ec) {
-            if (ec) {
-                self->close();
-                return;
-            }
-            self->in_frame_ = false;
-            self->client_name_ = ncs::tls::client_name(*self->tls_);
-            self->read_header();
-        });
+        self->tls_ = std::make_unique<ncs::tls::Channel>(self->tls_context_, nullptr);
+        self->shake_hands();
     });
+}
+
+// One step of the handshake: its records go out (a refusal's alert too, so
+// the client learns why), then it waits for the client's.
+void Session::shake_hands()
+{
+    asio::error_code ec;
+    const ncs::tls::Channel::Step step = tls_->handshake(ec);
+    const asio::const_buffer records = tls_->outgoing();
+    asio::async_write(socket_, records, ncs::net::whole,
+                      [self = shared_from_this(), step, sent = records.size()](const asio::error_code &ec, size_t) {
+                          if (ec || step == ncs::tls::Channel::Step::kFailed) {
+                              self->close();
+                              return;
+                          }
+                          self->tls_->sent(sent);
+                          if (step == ncs::tls::Channel::Step::kDone) {
+                              self->in_frame_ = false;
+                              self->client_name_ = self->tls_->peer_name();
+                              self->read_header();
+                              return;
+                          }
+                          self->fill([self](const asio::error_code &ec) {
+                              if (ec)
+                                  self->close();
+                              else
+                                  self->shake_hands();
+                          });
+                      });
 }
 
 void Session::on_body_bytes(const asio::error_code &ec, size_t got)
@@ -729,8 +788,17 @@ void Session::send(std::array<asio::const_buffer, 2> buffers, bool closing)
         self->on_sent(ec, closing);
     };
     if (tls_ != nullptr) {
-        asio::async_write(*tls_, buffers, ncs::net::whole, std::move(sent_all));
-        return;
+        // The frame goes as its records, which then move as plain bytes do.
+        asio::error_code ec;
+        for (const asio::const_buffer &buffer : buffers)
+            if (!ec)
+                tls_->seal(buffer, ec);
+        if (ec) {
+            on_sent(ec, true);
+            return;
+        }
+        buffers = {tls_->outgoing(), asio::const_buffer()};
+        tls_sending_ = buffers[0].size();
     }
     // What the socket buffer takes goes now; the rest is waited for.
     asio::error_code now;
@@ -748,6 +816,9 @@ void Session::on_sent(const asio::error_code &ec, bool closing)
 {
     in_call_ = false;
     reply_pkt_.reset();
+    if (tls_sending_ > 0 && !ec)
+        tls_->sent(tls_sending_);
+    tls_sending_ = 0;
     if (ec || closing) {
         close();
         return;

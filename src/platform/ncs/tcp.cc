@@ -29,6 +29,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace {
 
@@ -40,6 +41,8 @@ constexpr uint32_t kDefaultCallTimeoutMs = 120000;
 // Idle connections kept, over all addresses; the oldest goes first.
 constexpr size_t kMaxIdle = 64;
 constexpr uint32_t kDefaultClientIdleS = 60;
+// What one read of a TLS connection's socket takes at most.
+constexpr size_t kTlsReadChunk = 256 * 1024;
 
 [[noreturn]] void raise(uint32_t status)
 {
@@ -119,10 +122,17 @@ public:
         ec = run(deadline, [&](auto done) { socket_.async_connect(endpoint, done); });
         if (ec || tls == nullptr)
             return ec;
-        tls_context_ = tls;
-        tls_ = std::make_unique<asio::ssl::stream<tcp::socket &>>(socket_, *tls);
-        ncs::tls::expect_server(*tls_, endpoint.address());
-        return run(deadline, [&](auto done) { tls_->async_handshake(asio::ssl::stream_base::client, done); });
+        const asio::ip::address server = endpoint.address();
+        tls_ = std::make_unique<ncs::tls::Channel>(tls, &server);
+        for (;;) {
+            const ncs::tls::Channel::Step step = tls_->handshake(ec);
+            if (step == ncs::tls::Channel::Step::kFailed)
+                return ec;
+            if ((ec = flush(deadline)) || step == ncs::tls::Channel::Step::kDone)
+                return ec;
+            if ((ec = fill(deadline)))
+                return ec;
+        }
     }
 
     // Whether an idle connection is still open at the server's end: the
@@ -140,25 +150,58 @@ public:
 
     asio::error_code write(const std::array<asio::const_buffer, 2> &buffers, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) {
-            if (tls_ != nullptr)
-                asio::async_write(*tls_, buffers, ncs::net::whole, done);
-            else
-                asio::async_write(socket_, buffers, ncs::net::whole, done);
-        });
+        if (tls_ == nullptr)
+            return run(deadline, [&](auto done) { asio::async_write(socket_, buffers, ncs::net::whole, done); });
+        asio::error_code ec;
+        for (const asio::const_buffer &buffer : buffers)
+            if (!ec)
+                tls_->seal(buffer, ec);
+        return ec ? ec : flush(deadline);
     }
 
     asio::error_code read(asio::mutable_buffer buffer, Clock::time_point deadline)
     {
-        return run(deadline, [&](auto done) {
-            if (tls_ != nullptr)
-                asio::async_read(*tls_, buffer, ncs::net::whole, done);
-            else
-                asio::async_read(socket_, buffer, ncs::net::whole, done);
-        });
+        if (tls_ == nullptr)
+            return run(deadline, [&](auto done) { asio::async_read(socket_, buffer, ncs::net::whole, done); });
+        asio::error_code ec;
+        while (buffer.size() > 0) {
+            buffer += tls_->open(buffer, ec);
+            if (ec || (buffer.size() > 0 && (ec = fill(deadline))))
+                return ec;
+        }
+        return ec;
     }
 
 private:
+    // Sends the records that the TLS channel made.
+    asio::error_code flush(Clock::time_point deadline)
+    {
+        const asio::const_buffer records = tls_->outgoing();
+        if (records.size() == 0)
+            return {};
+        asio::error_code ec =
+            run(deadline, [&](auto done) { asio::async_write(socket_, records, ncs::net::whole, done); });
+        if (!ec)
+            tls_->sent(records.size());
+        return ec;
+    }
+
+    // Feeds the TLS channel what the socket has, waiting for some if need be.
+    asio::error_code fill(Clock::time_point deadline)
+    {
+        if (incoming_.empty())
+            incoming_.resize(kTlsReadChunk);
+        size_t got = 0;
+        asio::error_code ec = run(deadline, [&](auto done) {
+            socket_.async_read_some(asio::buffer(incoming_), [&got, done](const asio::error_code &ec, size_t n) {
+                got = n;
+                done(ec);
+            });
+        });
+        tls_->feed(incoming_.data(), got);
+        return ec;
+    }
+
     // Starts one operation and runs it to its end or to the deadline.
     template <class Start>
     asio::error_code run(Clock::time_point deadline, Start start)
@@ -180,8 +223,8 @@ private:
 
     asio::io_context io_{1};
     tcp::socket socket_{io_};
-    std::shared_ptr<ncs::tls::Context> tls_context_;  // outlives tls_
-    std::unique_ptr<asio::ssl::stream<tcp::socket &>> tls_;
+    std::unique_ptr<ncs::tls::Channel> tls_;  // null for plain TCP
+    std::vector<unsigned char> incoming_;     // records read for tls_
     std::string key_;
     Clock::time_point idle_since_{};
     bool served_ = false;  // an exchange has gone through since the connect

@@ -116,9 +116,25 @@ std::shared_ptr<Context> server_context()
     return g_server;
 }
 
-void expect_server(asio::ssl::stream<asio::ip::tcp::socket &> &stream, const asio::ip::address &address)
+Channel::Channel(const std::shared_ptr<Context> &context, const asio::ip::address *server)
+    : context_(context), ssl_(SSL_new(context->native_handle())), in_(BIO_new(BIO_s_mem())),
+      out_(BIO_new(BIO_s_mem()))
 {
-    std::string name = address.to_string();
+    if (ssl_ == nullptr || in_ == nullptr || out_ == nullptr) {
+        BIO_free(in_);
+        BIO_free(out_);
+        SSL_free(ssl_);
+        throw std::bad_alloc();
+    }
+    // An empty input is "more to come", not the end.
+    BIO_set_mem_eof_return(in_, -1);
+    SSL_set_bio(ssl_, in_, out_);
+    if (server == nullptr) {
+        SSL_set_accept_state(ssl_);
+        return;
+    }
+    SSL_set_connect_state(ssl_);
+    std::string name = server->to_string();
     {
         std::lock_guard<std::mutex> hold(g_mutex);
         auto known = g_names.find(name);
@@ -127,14 +143,92 @@ void expect_server(asio::ssl::stream<asio::ip::tcp::socket &> &stream, const asi
     }
     asio::error_code literal;
     asio::ip::make_address(name, literal);
-    if (literal)
-        SSL_set_tlsext_host_name(stream.native_handle(), name.c_str());
-    stream.set_verify_callback(asio::ssl::host_name_verification(name));
+    if (literal) {
+        SSL_set_tlsext_host_name(ssl_, name.c_str());
+        SSL_set1_host(ssl_, name.c_str());
+    } else {
+        X509_VERIFY_PARAM_set1_ip_asc(SSL_get0_param(ssl_), name.c_str());
+    }
 }
 
-std::string client_name(asio::ssl::stream<asio::ip::tcp::socket &> &stream)
+Channel::~Channel()
 {
-    X509 *certificate = SSL_get1_peer_certificate(stream.native_handle());
+    SSL_free(ssl_);
+}
+
+asio::error_code Channel::failure(int result) const
+{
+    const int kind = SSL_get_error(ssl_, result);
+    if (kind == SSL_ERROR_ZERO_RETURN)
+        return asio::error::eof;
+    const unsigned long error = ERR_get_error();
+    ERR_clear_error();
+    if (error == 0)
+        return asio::error::connection_reset;
+    return asio::error_code(static_cast<int>(error), asio::error::get_ssl_category());
+}
+
+Channel::Step Channel::handshake(asio::error_code &ec)
+{
+    const int result = SSL_do_handshake(ssl_);
+    if (result == 1)
+        return Step::kDone;
+    const int kind = SSL_get_error(ssl_, result);
+    if (kind == SSL_ERROR_WANT_READ || kind == SSL_ERROR_WANT_WRITE)
+        return Step::kNeedInput;
+    ec = failure(result);
+    return Step::kFailed;
+}
+
+void Channel::seal(asio::const_buffer bytes, asio::error_code &ec)
+{
+    size_t written = 0;
+    if (bytes.size() > 0 && SSL_write_ex(ssl_, bytes.data(), bytes.size(), &written) != 1)
+        ec = failure(0);
+}
+
+asio::const_buffer Channel::outgoing()
+{
+    char *data = nullptr;
+    const long size = BIO_get_mem_data(out_, &data);
+    return asio::buffer(data + out_sent_, static_cast<size_t>(size) - out_sent_);
+}
+
+void Channel::sent(size_t n)
+{
+    out_sent_ += n;
+    if (out_sent_ == static_cast<size_t>(BIO_ctrl_pending(out_))) {
+        BIO_reset(out_);
+        out_sent_ = 0;
+    }
+}
+
+void Channel::feed(const void *bytes, size_t n)
+{
+    if (n > 0)
+        BIO_write(in_, bytes, static_cast<int>(n));
+}
+
+size_t Channel::open(asio::mutable_buffer buffer, asio::error_code &ec)
+{
+    auto *at = static_cast<unsigned char *>(buffer.data());
+    size_t total = 0;
+    while (total < buffer.size()) {
+        size_t got = 0;
+        if (SSL_read_ex(ssl_, at + total, buffer.size() - total, &got) != 1) {
+            // A failure after some bytes comes back with the next call.
+            if (total == 0 && SSL_get_error(ssl_, 0) != SSL_ERROR_WANT_READ)
+                ec = failure(0);
+            break;
+        }
+        total += got;
+    }
+    return total;
+}
+
+std::string Channel::peer_name() const
+{
+    X509 *certificate = SSL_get1_peer_certificate(ssl_);
     if (certificate == nullptr)
         return "";
     char name[256] = "";
