@@ -559,7 +559,11 @@ void Session::on_header()
     }
     body_got_ = 0;
     if (request_.body_len == 0) {
-        call();
+        request_pkt_ = allocate_packet(0);
+        if (request_pkt_ == nullptr)
+            send_fault(request_.call_id, rpc__s_no_memory);
+        else
+            call();
         return;
     }
     // The body's room is taken once its first bytes are in, not on the
