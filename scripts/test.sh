@@ -11,7 +11,13 @@ jobs=${DPX_JOBS:-2}
 
 echo "== normal build"
 cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-cmake --build build -j"$jobs"
+# A warning of the compiler or the linker fails the run: the build starts
+# clean and stays so.
+cmake --build build -j"$jobs" 2>&1 | tee build/build.log
+if grep -iE '(^|[^a-z])warning:' build/build.log; then
+  echo "the build printed the warnings above" >&2
+  exit 1
+fi
 ctest --test-dir build --output-on-failure -j"$jobs" --timeout 900
 
 echo "== AddressSanitizer + UndefinedBehaviorSanitizer build"

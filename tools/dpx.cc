@@ -50,6 +50,8 @@ const char kUsage[] =
     "  DPX_MAX_RETRY           tries of a call while the hub is busy (default 6)\n"
     "  DPX_MIN_RETRY_INTERVAL  first sleep in seconds after a busy answer (default 3)\n"
     "  AFW_ORIGIN_NODE         this node's name, sent by query when NODE is -\n"
+    "  NCS_TLS_CERT, NCS_TLS_KEY, NCS_TLS_CA  TLS to the hub: this client's certificate,\n"
+    "                          its key and the CA that signed the hub's (see dpx-agentd)\n"
     "  TRC1_FLAGS, TRC1_FILE   tracing: flag mask and the file to append to\n";
 
 constexpr uint64_t kProgressThreshold = 8ull << 20;
@@ -146,7 +148,8 @@ private:
             return;
         shown_ = true;
         double rate = seconds > 0 ? moved / seconds : 0;
-        std::string line = "\r" + human_bytes(static_cast<double>(moved));
+        std::string line = "\r";
+        line += human_bytes(static_cast<double>(moved));
         if (total_ > 0)
             line += " of " + human_bytes(static_cast<double>(total_));
         line += ", " + human_bytes(rate) + "/s";

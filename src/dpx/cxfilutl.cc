@@ -3,6 +3,7 @@
 #include "cxfile.h"
 
 #include <cerrno>
+#include <dlfcn.h>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -133,6 +134,22 @@ cx_status cx_close_file(cx_os_file_t *file)
     return status;
 }
 
+namespace {
+
+using TempnamFunction = char *(*)(const char *, const char *);
+
+// The platform's tempnam, looked up when first needed instead of linked by
+// name: the C library marks the name so that every link against it warns
+// (it suggests mkstemp, which would open the file itself, with other
+// permissions).
+TempnamFunction platform_tempnam()
+{
+    static const TempnamFunction found = reinterpret_cast<TempnamFunction>(dlsym(RTLD_DEFAULT, "tempnam"));
+    return found;
+}
+
+}  // namespace
+
 cx_status cx_temp_file(const char *directory, char **name, cx_os_file_t *file)
 {
     return cx_temp_posix_file(directory, name, file);
@@ -146,6 +163,9 @@ cx_status cx_temp_posix_file(const char *directory, char **name, cx_os_file_t *f
     *name = nullptr;
     // A null directory leaves the choice to the platform ("TMPDIR", then
     // P_tmpdir).
+    TempnamFunction tempnam = platform_tempnam();
+    if (tempnam == nullptr)
+        return cx_posix_failure(ENOSYS);
     char *made = tempnam(directory, "cxp");
     if (made == nullptr)
         return cx_errno_failure();
