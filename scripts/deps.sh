@@ -4,7 +4,8 @@
 set -euo pipefail
 
 packages=(g++ cmake make pkg-config zlib1g-dev libicu-dev libasio-dev libgtest-dev libgmock-dev
-          libbenchmark-dev libssl-dev openssl openjdk-17-jdk-headless clang libclang-rt-14-dev iproute2 nftables)
+          libbenchmark-dev libssl-dev openssl libsystemd-dev openjdk-17-jdk-headless clang libclang-rt-14-dev iproute2 nftables
+          tcpdump systemd man-db groff-base lintian dpkg-dev fakeroot file)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

@@ -6,7 +6,7 @@ set -euo pipefail
 header=$1 library=$2
 declared=$(grep -v "^#define" "$header" | tr '\n' ' ' | grep -oE 'DPX_API[^;{]*' |
   sed -E 's/\(.*//; s/\[.*//; s/.*[^A-Za-z0-9_]([A-Za-z_][A-Za-z0-9_]*)\s*$/\1/' | sort -u)
-exported=$(nm -D --defined-only "$library" | awk '{print $3}' | grep -v -e '^_Z' -e '^__' | sort -u)
+exported=$(nm -D --defined-only "$library" | awk '{print $3}' | sed 's/@.*//' | grep -v -e '^_Z' -e '^__' -e '^DPX_1$' | sort -u)
 missing=$(comm -23 <(echo "$declared") <(echo "$exported"))
 extra=$(comm -13 <(echo "$declared") <(echo "$exported"))
 [ -z "$missing" ] || { echo "declared but not exported:"; echo "$missing"; }

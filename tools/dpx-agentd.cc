@@ -15,6 +15,7 @@
 #include <future>
 #include <optional>
 #include <pthread.h>
+#include <systemd/sd-daemon.h>
 #include <string>
 #include <thread>
 
@@ -379,6 +380,8 @@ int main(int argc, char **argv)
     bool v6 = std::strchr(name, ':') != nullptr;
     std::printf("listening on %s%s%s:%u\n", v6 ? "[" : "", name, v6 ? "]" : "", port);
     std::fflush(stdout);
+    // Ready for a service manager that waits for it (Type=notify).
+    sd_notify(0, "READY=1");
     std::fprintf(stderr, "dpx-agentd: serving %s/%s with %u threads%s%s%s%s\n", options.depot.c_str(),
                  options.product.c_str(), options.threads, options.hub ? ", hub" : "",
                  options.broker ? ", broker" : "", tls ? ", TLS" : "", options.read_only ? ", read-only" : "");
@@ -396,6 +399,7 @@ int main(int argc, char **argv)
             signal_number = sigtimedwait(&stop_signals, nullptr, &wait);
         }
         if (signal_number == SIGHUP) {
+            sd_notify(0, "RELOADING=1");
             if (tls) {
                 rpc__tls_server(options.tls_cert.c_str(), options.tls_key.c_str(), options.tls_ca.c_str(), &status);
                 if (status == rpc__s_ok)
@@ -403,6 +407,7 @@ int main(int argc, char **argv)
                 else
                     log_line("cannot reload the TLS files, the old ones stay", status);
             }
+            sd_notify(0, "READY=1");
             continue;
         }
         if (signal_number >= 0)
@@ -418,6 +423,7 @@ int main(int argc, char **argv)
         }
     }
     std::fprintf(stderr, "dpx-agentd: signal %d, stopping\n", signal_number);
+    sd_notify(0, "STOPPING=1");
 
     // Out of the broker first, so that no client finds this server any more;
     // then the calls under way run to their end before the library stops.

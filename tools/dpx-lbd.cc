@@ -5,6 +5,7 @@
 #include "trc/trc1.h"
 
 #include <pthread.h>
+#include <systemd/sd-daemon.h>
 
 #include <csignal>
 #include <cstdio>
@@ -119,9 +120,12 @@ int main(int argc, char **argv)
     std::printf("listening on %s\n", address.c_str());
     std::fflush(stdout);
     std::fprintf(stderr, "dpx-lbd: broker running on %s\n", address.c_str());
+    // Ready for a service manager that waits for it (Type=notify).
+    sd_notify(0, "READY=1");
 
     int signal = 0;
     sigwait(&signals, &signal);
     std::fprintf(stderr, "dpx-lbd: stopping on signal %d (%s)\n", signal, strsignal(signal));
+    sd_notify(0, "STOPPING=1");
     return 0;
 }
