@@ -1,8 +1,6 @@
 // Stub support: this machine's data representation and the EBCDIC tables.
 #include "nrtr/nrtr1.h"
 
-#include "ncs/ncs.h"
-
 namespace {
 
 // ISO 8859-1 to EBCDIC code page 037, generated from the code page's mapping.

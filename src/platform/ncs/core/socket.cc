@@ -1,11 +1,14 @@
 // Host names and socket addresses.
 #include "ncs/ncs.h"
-#include "ncs/tls.h"
+#include "ncs/runtime.h"
 
 #include <netdb.h>
 
 #include <cstring>
+#include <map>
 #include <memory>
+#include <mutex>
+#include <string>
 
 namespace {
 
@@ -51,7 +54,42 @@ AddrinfoList resolve(const char *host, int family)
     return AddrinfoList(list);
 }
 
+// The names that addresses were resolved from, by the address's bytes; a
+// bounded few, the oldest key going first when full.
+constexpr size_t kMaxNames = 256;
+std::mutex g_names_mutex;  // guards g_names
+std::map<std::string, std::string> g_names;
+
+std::string address_key(const socket__addr_t &addr)
+{
+    if (addr.sa.sa_family == AF_INET)
+        return std::string(reinterpret_cast<const char *>(&addr.in4.sin_addr), sizeof addr.in4.sin_addr);
+    if (addr.sa.sa_family == AF_INET6)
+        return std::string(reinterpret_cast<const char *>(&addr.in6.sin6_addr), sizeof addr.in6.sin6_addr);
+    return "";
+}
+
+void remember_name(const socket__addr_t &addr, const std::string &host)
+{
+    const std::string key = address_key(addr);
+    std::lock_guard<std::mutex> hold(g_names_mutex);
+    if (g_names.size() >= kMaxNames && g_names.count(key) == 0)
+        g_names.erase(g_names.begin());
+    g_names[key] = host;
+}
+
 }  // namespace
+
+namespace ncs {
+
+std::string host_name_of(const socket__addr_t &addr)
+{
+    std::lock_guard<std::mutex> hold(g_names_mutex);
+    auto known = g_names.find(address_key(addr));
+    return known != g_names.end() ? known->second : "";
+}
+
+}  // namespace ncs
 
 extern "C" {
 
@@ -94,7 +132,7 @@ void socket__from_name(uint32_t family, const char *name, uint32_t name_len, uin
     std::memcpy(addr->bytes, result.bytes, first.ai_addrlen);
     *addr_len = static_cast<uint32_t>(first.ai_addrlen);
     try {
-        ncs::tls::remember_name(result, host);
+        remember_name(result, host);
     } catch (...) {
         // Without the name, TLS checks the server's certificate against its address.
     }

@@ -437,14 +437,8 @@ public:
     }
 };
 
+TcpCarrier g_tcp_carrier;
+// Calls to IPv4 and IPv6 addresses come here from the library's load on.
+const bool g_registered = (ncs::set_network_carrier(g_tcp_carrier), true);
+
 }  // namespace
-
-namespace ncs {
-
-Carrier &tcp_carrier()
-{
-    static TcpCarrier carrier;
-    return carrier;
-}
-
-}  // namespace ncs

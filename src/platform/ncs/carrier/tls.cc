@@ -2,6 +2,7 @@
 #include "ncs/tls.h"
 
 #include "ncs/net.h"
+#include "ncs/runtime.h"
 #include "ncs/server.h"
 #include "plt/plt1.h"
 #include "trc/trc1.h"
@@ -18,7 +19,6 @@ namespace ncs::tls {
 
 namespace {
 
-constexpr size_t kMaxNames = 256;
 
 struct Files {
     std::string cert, key, ca;
@@ -83,7 +83,6 @@ std::mutex g_mutex;  // guards the members below
 Files g_client_files;
 std::shared_ptr<Context> g_client;
 std::shared_ptr<Context> g_server;
-std::map<std::string, std::string> g_names;  // host names by address
 
 }  // namespace
 
@@ -134,13 +133,11 @@ Channel::Channel(const std::shared_ptr<Context> &context, const asio::ip::addres
         return;
     }
     SSL_set_connect_state(ssl_);
-    std::string name = server->to_string();
-    {
-        std::lock_guard<std::mutex> hold(g_mutex);
-        auto known = g_names.find(name);
-        if (known != g_names.end())
-            name = known->second;
-    }
+    socket__addr_t addr;
+    net::address_of(asio::ip::tcp::endpoint(*server, 0), addr);
+    std::string name = host_name_of(addr);
+    if (name.empty())
+        name = server->to_string();
     asio::error_code literal;
     asio::ip::make_address(name, literal);
     if (literal) {
@@ -237,14 +234,6 @@ std::string Channel::peer_name() const
     return name;
 }
 
-void remember_name(const socket__addr_t &addr, const std::string &host)
-{
-    const std::string address = net::endpoint_of(addr).address().to_string();
-    std::lock_guard<std::mutex> hold(g_mutex);
-    if (g_names.size() >= kMaxNames && g_names.count(address) == 0)
-        g_names.erase(g_names.begin());
-    g_names[address] = host;
-}
 
 uint32_t status_of(const asio::error_code &ec)
 {

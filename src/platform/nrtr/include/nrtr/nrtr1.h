@@ -16,6 +16,25 @@ extern "C" {
 
 #define NRTR1_API __attribute__((visibility("default")))
 
+/* ---- Data representation of a body --------------------------------- */
+
+/* drep: bits 31..28 int_rep (0 big-endian, 1 little-endian), 27..24
+ * char_rep (0 ASCII, 1 EBCDIC), 23..16 float_rep (0 IEEE). */
+#define NCS_DREP(int_rep, char_rep, float_rep) \
+    ((((uint32_t)(int_rep)&0xFu) << 28) | (((uint32_t)(char_rep)&0xFu) << 24) | (((uint32_t)(float_rep)&0xFFu) << 16))
+#define NCS_DREP_INT(d)   (((d) >> 28) & 0xFu)
+#define NCS_DREP_CHAR(d)  (((d) >> 24) & 0xFu)
+#define NCS_DREP_FLOAT(d) (((d) >> 16) & 0xFFu)
+#define NCS_INT_BIG    0u
+#define NCS_INT_LITTLE 1u
+#define NCS_CHAR_ASCII  0u
+#define NCS_CHAR_EBCDIC 1u
+#if __BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__
+#define NCS_DREP_LOCAL NCS_DREP(NCS_INT_LITTLE, NCS_CHAR_ASCII, 0)
+#else
+#define NCS_DREP_LOCAL NCS_DREP(NCS_INT_BIG, NCS_CHAR_ASCII, 0)
+#endif
+
 #define IDLBASE_DATA_SIZE 80u
 
 /* Filled once per stub group by NRTR1_InitData. Pointer fields are 8 bytes

@@ -15,6 +15,8 @@
 #include <stdint.h>
 #include <sys/socket.h>
 
+#include "nrtr/nrtr1.h"
+
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -97,25 +99,6 @@ typedef struct rpc__if_spec_t {
     uint16_t gap;
     uuid__t id;
 } rpc__if_spec_t;
-
-/* ---- Data representation ----------------------------------------------- */
-
-/* drep: bits 31..28 int_rep (0 big-endian, 1 little-endian), 27..24
- * char_rep (0 ASCII, 1 EBCDIC), 23..16 float_rep (0 IEEE). */
-#define NCS_DREP(int_rep, char_rep, float_rep) \
-    ((((uint32_t)(int_rep)&0xFu) << 28) | (((uint32_t)(char_rep)&0xFu) << 24) | (((uint32_t)(float_rep)&0xFFu) << 16))
-#define NCS_DREP_INT(d)   (((d) >> 28) & 0xFu)
-#define NCS_DREP_CHAR(d)  (((d) >> 24) & 0xFu)
-#define NCS_DREP_FLOAT(d) (((d) >> 16) & 0xFFu)
-#define NCS_INT_BIG    0u
-#define NCS_INT_LITTLE 1u
-#define NCS_CHAR_ASCII  0u
-#define NCS_CHAR_EBCDIC 1u
-#if __BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__
-#define NCS_DREP_LOCAL NCS_DREP(NCS_INT_LITTLE, NCS_CHAR_ASCII, 0)
-#else
-#define NCS_DREP_LOCAL NCS_DREP(NCS_INT_BIG, NCS_CHAR_ASCII, 0)
-#endif
 
 /* ---- Socket addresses -------------------------------------------------- */
 
@@ -246,6 +229,12 @@ NCS_API void rpc__register_mgr(const uuid__t *type, const rpc__if_spec_t *ifspec
  * takes the table away: such calls are then answered with the fault
  * rpc__s_server_busy. rpc__s_not_registered without a registration. */
 NCS_API void rpc__register_busy_mgr(const rpc__if_spec_t *ifspec, const void *busy_mgr_epv, uint32_t *status);
+/* The common name in the certificate of the client whose call a manager
+ * runs, from the manager's `handle`, in `name` (cut to size - 1 characters
+ * and a NUL); the empty text on a connection without TLS.
+ * rpc__s_invalid_handle for a handle that isn't a manager's. */
+NCS_API void rpc__inq_client_name(handle_t handle, char *name, size_t size, uint32_t *status);
+
 /* Takes the registration of the interface's UUID and version away; new
  * requests get rpc__s_unknown_if at once. Calls that already run go on to
  * their end on the old registration; the call doesn't wait for them.

@@ -6,6 +6,7 @@
 #include "ncs/ncs.h"
 
 #include <cstdint>
+#include <string>
 
 namespace ncs {
 
@@ -62,9 +63,17 @@ void *place_reply(uint32_t len, void *reply_buf, uint32_t reply_buf_size, Reply 
 // is unset or holds anything else.
 uint32_t setting(const char *name, uint32_t dflt);
 
-// The carrier for the in-process family, and for IPv4 and IPv6.
+// The carrier for the in-process family.
 Carrier &inproc_carrier();
-Carrier &tcp_carrier();
+// The carrier for IPv4 and IPv6, which the layer above registers as the
+// library loads; null before.
+Carrier *network_carrier();
+void set_network_carrier(Carrier &carrier);
+
+// The host name that socket__from_name resolved to the IP address of
+// `addr` (the last such name), or the empty text: what a TLS client checks
+// the server's certificate against.
+std::string host_name_of(const socket__addr_t &addr);
 
 // The outcome of one dispatched request.
 struct Dispatched {

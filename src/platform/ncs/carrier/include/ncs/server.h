@@ -54,12 +54,6 @@ NCS_API void rpc__listen(const char *host, uint32_t port, uint32_t threads, sock
  * client is answered rpc__s_tls_required and closed. */
 NCS_API void rpc__tls_server(const char *cert, const char *key, const char *ca, uint32_t *status);
 
-/* The common name in the certificate of the client whose call a manager
- * runs, from the manager's `handle`, in `name` (cut to size - 1 characters
- * and a NUL); the empty text on a connection without TLS.
- * rpc__s_invalid_handle for a handle that isn't a manager's. */
-NCS_API void rpc__inq_client_name(handle_t handle, char *name, size_t size, uint32_t *status);
-
 /* Stops the server: no further connection is accepted, connections that
  * wait for a request are closed, calls under way run to their end and send
  * their replies, then every thread of the server is joined. A call whose

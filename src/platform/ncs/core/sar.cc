@@ -2,6 +2,7 @@
 // handle's address family.
 #include "ncs/runtime.h"
 
+#include <atomic>
 #include <new>
 
 namespace {
@@ -11,9 +12,21 @@ namespace {
     EXC1__Raise(EXC1_Thread(), status);
 }
 
+std::atomic<ncs::Carrier *> g_network_carrier{nullptr};
+
 }  // namespace
 
 namespace ncs {
+
+Carrier *network_carrier()
+{
+    return g_network_carrier.load();
+}
+
+void set_network_carrier(Carrier &carrier)
+{
+    g_network_carrier = &carrier;
+}
 
 void *place_reply(uint32_t len, void *reply_buf, uint32_t reply_buf_size, Reply &reply)
 {
@@ -48,13 +61,16 @@ void rpc__sar(handle_t handle, uint32_t options, const rpc__if_spec_t *ifspec, u
     // The call works on a copy: the handle may be re-pointed once it returns.
     socket__addr_t addr = h->addr;
     uint32_t addr_len = h->addr_len;
-    ncs::Carrier &carrier = addr.sa.sa_family == socket__family_inproc ? ncs::inproc_carrier() : ncs::tcp_carrier();
+    ncs::Carrier *carrier =
+        addr.sa.sa_family == socket__family_inproc ? &ncs::inproc_carrier() : ncs::network_carrier();
+    if (carrier == nullptr)
+        raise(rpc__s_comm_failure);
 
     ncs::Reply reply;
     // Raises pass; any other exception of a carrier becomes a raise here, so
     // nothing but exc::Fault leaves this function.
     try {
-        carrier.call(addr, addr_len, options, *ifspec, opnum, request_pkt, request_len, reply_buf, reply_buf_size,
+        carrier->call(addr, addr_len, options, *ifspec, opnum, request_pkt, request_len, reply_buf, reply_buf_size,
                      reply);
     } catch (const exc::Fault &) {
         throw;

@@ -6,7 +6,6 @@
 // so an interface unregistered while its calls run is gone for new calls at
 // once, and the calls under way finish on the registration they started with.
 #include "ncs/runtime.h"
-#include "ncs/server.h"
 
 #include <array>
 #include <atomic>

@@ -76,10 +76,6 @@ private:
     size_t out_sent_ = 0;
 };
 
-// Notes that `host` was looked up and gave the IPv4 or IPv6 `addr`, for the
-// check above.
-void remember_name(const socket__addr_t &addr, const std::string &host);
-
 // The communication status of a TLS failure.
 uint32_t status_of(const asio::error_code &ec);
 

@@ -1,7 +1,6 @@
 // Texts of the statuses this system can meet: the runtime's own and those of
 // the file transfer library (0xF11E00xx), which the library returns as plain
 // numbers through the same status words.
-#include "ncs/lb.h"
 #include "ncs/ncs.h"
 
 #include <algorithm>
