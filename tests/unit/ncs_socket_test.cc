@@ -65,7 +65,7 @@ TEST(StatusTexts, EveryStatusDefinedInTheHeadersHasATextCutToTheBuffer)
     std::filesystem::path root = std::filesystem::path(__FILE__).parent_path().parent_path().parent_path();
     const std::regex define(R"(#define\s+(\w+__s_\w+|DPX_E_\w+)\s+(0x[0-9A-Fa-f]+)u)");
     int seen = 0;
-    for (const char *header : {"src/platform/ncs/ncs.h", "include/dpx/dpx.h"}) {
+    for (const char *header : {"src/platform/ncs/core/include/ncs/ncs.h", "include/dpx/dpx.h"}) {
         std::ifstream in(root / header);
         const std::string body{std::istreambuf_iterator<char>(in), {}};
         for (std::sregex_iterator m(body.begin(), body.end(), define), end; m != end; ++m, ++seen) {

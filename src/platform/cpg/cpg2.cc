@@ -71,17 +71,11 @@ int32_t code_of(UErrorCode error)
     return CPG2_E_CONVERSION;
 }
 
-// A whole positive decimal number that fits, else 0.
+// A whole positive number that fits, else 0.
 int32_t parse_codepage(const char *text)
 {
-    // strtol alone would also take leading blanks and a sign.
-    if (text == nullptr || *text < '0' || *text > '9')
-        return 0;
-    errno = 0;
-    char *end = nullptr;
-    long value = std::strtol(text, &end, 10);
-    if (*end != '\0' || errno == ERANGE || value <= 0 || value > INT32_MAX)
-        return 0;
+    uint32_t value = 0;
+    PLT1_ParseNumber(text, 1, INT32_MAX, &value);
     return static_cast<int32_t>(value);
 }
 

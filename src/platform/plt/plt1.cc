@@ -1,8 +1,10 @@
 #include "plt/plt1.h"
 
 #include <atomic>
+#include <charconv>
 #include <chrono>
 #include <cstdlib>
+#include <cstring>
 #include <mutex>
 #include <thread>
 
@@ -12,14 +14,9 @@ std::atomic<uint64_t> g_sleep_count{0};
 std::atomic<uint64_t> g_sleep_seconds{0};
 std::recursive_mutex g_once_mutex;  // a routine may itself set up another gate
 
-long sleep_unit_ms()
+int64_t sleep_unit_ms()
 {
-    const char *v = std::getenv("PLT1_SLEEP_UNIT_MS");
-    if (v == nullptr || *v == '\0')
-        return 1000;
-    char *end = nullptr;
-    long ms = std::strtol(v, &end, 10);
-    return (end != v && ms >= 0) ? ms : 1000;
+    return PLT1_GetEnvNumber("PLT1_SLEEP_UNIT_MS", 0, UINT32_MAX, 1000);
 }
 
 }  // namespace
@@ -32,6 +29,29 @@ const char *PLT1_GetEnv(const char *name, const char *dflt)
         return dflt;
     const char *v = std::getenv(name);
     return v != nullptr ? v : dflt;
+}
+
+int PLT1_ParseNumber(const char *text, uint32_t min, uint32_t max, uint32_t *value)
+{
+    if (text == nullptr || value == nullptr)
+        return 0;
+    const bool hex = text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
+    const char *begin = hex ? text + 2 : text;
+    const char *end = begin + std::strlen(begin);
+    uint32_t parsed = 0;
+    // from_chars takes no blank, sign or prefix: the text is digits only.
+    auto [stop, error] = std::from_chars(begin, end, parsed, hex ? 16 : 10);
+    if (error != std::errc() || stop != end || stop == begin || parsed < min || parsed > max)
+        return 0;
+    *value = parsed;
+    return 1;
+}
+
+uint32_t PLT1_GetEnvNumber(const char *name, uint32_t min, uint32_t max, uint32_t dflt)
+{
+    uint32_t value = dflt;
+    PLT1_ParseNumber(PLT1_GetEnv(name, nullptr), min, max, &value);
+    return value;
 }
 
 void PLT1_InitializeLock(PLT1_LOCK *lock)

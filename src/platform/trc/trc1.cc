@@ -30,14 +30,6 @@ Config &config()
     return *c;
 }
 
-uint32_t parse_flags(const char *text)
-{
-    if (text == nullptr || *text == '\0')
-        return 0;
-    char *end = nullptr;
-    unsigned long v = std::strtoul(text, &end, 0);
-    return end == text ? 0 : static_cast<uint32_t>(v);
-}
 
 void close_out(Config &c)
 {
@@ -56,7 +48,7 @@ void load_locked(Config &c)
 {
     if (c.loaded)
         return;
-    c.flags = parse_flags(PLT1_GetEnv("TRC1_FLAGS", nullptr));
+    c.flags = PLT1_GetEnvNumber("TRC1_FLAGS", 0, UINT32_MAX, 0);
     const char *file = PLT1_GetEnv("TRC1_FILE", nullptr);
     close_out(c);
     c.file = file != nullptr ? file : "";

@@ -1,8 +1,11 @@
 // The location broker: its database, the service on TCP that each host runs
 // (inside a host process or as dpx-lbd), and the client side: lookups and the
 // registrations of this process. Messages are those of lb_format.h.
+#include "ncs/deadline.h"
+#include "ncs/guard.h"
 #include "ncs/lb.h"
 #include "ncs/lb_format.h"
+#include "ncs/net.h"
 #include "plt/plt1.h"
 #include "trc/trc1.h"
 
@@ -46,25 +49,13 @@ constexpr uint32_t kMaxSerial = INT32_MAX;
 // Owner of the entries that the host process of a broker registers directly.
 constexpr uint64_t kHostProcess = 0;
 
-void set_status(uint32_t *status, uint32_t value)
-{
-    if (status != nullptr)
-        *status = value;
-}
+using ncs::set_status;
 
 // Runs `body`, which returns a status, so that nothing throws across the C API.
 template <class Body>
 void guarded(uint32_t *status, Body &&body)
 {
-    uint32_t result;
-    try {
-        result = body();
-    } catch (const std::bad_alloc &) {
-        result = rpc__s_no_memory;
-    } catch (...) {
-        result = rpc__s_fault_unspec;
-    }
-    set_status(status, result);
+    ncs::guarded(status, rpc__s_fault_unspec, body);
 }
 
 bool matches(const uuid__t &wanted, const uuid__t &have)
@@ -80,21 +71,6 @@ bool same_key(const lb__entry_t &a, const lb__entry_t &b)
            std::memcmp(a.saddr.bytes, b.saddr.bytes, a.saddr_len) == 0;
 }
 
-// The TCP endpoint of an IPv4 or IPv6 address, at `port`; false for any other.
-bool to_endpoint(const socket__addr_t &addr, uint32_t addr_len, uint16_t port, tcp::endpoint &endpoint)
-{
-    size_t size;
-    if (addr_len >= sizeof addr.in4 && addr.sa.sa_family == AF_INET)
-        size = sizeof addr.in4;
-    else if (addr_len >= sizeof addr.in6 && addr.sa.sa_family == AF_INET6)
-        size = sizeof addr.in6;
-    else
-        return false;
-    std::memcpy(endpoint.data(), addr.bytes, size);
-    endpoint.resize(size);
-    endpoint.port(port);
-    return true;
-}
 
 // "interface <uuid> at <host>:<port>", for traces.
 std::string describe(const lb__entry_t &entry)
@@ -629,22 +605,10 @@ public:
     }
 
 private:
-    // Runs the operation that `start` begins until it completes or `deadline`
-    // passes; a late one is cut off by closing the socket.
     template <class Start>
     asio::error_code run(Clock::time_point deadline, Start &&start)
     {
-        std::optional<asio::error_code> outcome;
-        start([&outcome](const asio::error_code &ec, auto &&...) { outcome = ec; });
-        io_.restart();
-        io_.run_until(deadline);
-        if (outcome)
-            return *outcome;
-        asio::error_code ignored;
-        socket_.close(ignored);
-        io_.restart();
-        io_.run();
-        return asio::error::timed_out;
+        return ncs::run_until(io_, socket_, deadline, start);
     }
 
     asio::io_context io_;
@@ -733,7 +697,7 @@ bool broker_endpoint(const socket__addr_t *location, uint32_t location_len, tcp:
         endpoint = tcp::endpoint(asio::ip::address_v4::loopback(), port);
         return true;
     }
-    return to_endpoint(*location, location_len, port, endpoint);
+    return ncs::net::endpoint_from(*location, location_len, port, endpoint);
 }
 
 uint32_t lookup(const uuid__t *object, const uuid__t *type, const uuid__t *interface,
@@ -789,7 +753,7 @@ uint32_t start_broker(const char *host)
     uint32_t status;
     socket__from_name(0, name, static_cast<uint32_t>(strnlen(name, UINT32_MAX)), port, &addr, &addr_len, &status);
     tcp::endpoint endpoint;
-    if (status != rpc__s_ok || !to_endpoint(addr, addr_len, port, endpoint))
+    if (status != rpc__s_ok || !ncs::net::endpoint_from(addr, addr_len, port, endpoint))
         return rpc__s_unknown_host;
 
     Embedded &e = embedded();
@@ -878,15 +842,7 @@ void lb__inq_broker(socket__addr_t *addr, uint32_t *addr_len, uint32_t *status)
 
 uint16_t lb__broker_port(void)
 {
-    const char *text = PLT1_GetEnv("NCS_LB_PORT", nullptr);
-    if (text == nullptr)
-        return kDefaultPort;
-    const char *end = text + std::strlen(text);
-    unsigned value = 0;
-    auto [stop, error] = std::from_chars(text, end, value);
-    if (error != std::errc() || stop != end || stop == text || value > 0xFFFF)
-        return kDefaultPort;
-    return static_cast<uint16_t>(value);
+    return static_cast<uint16_t>(PLT1_GetEnvNumber("NCS_LB_PORT", 0, 0xFFFF, kDefaultPort));
 }
 
 }  // extern "C"

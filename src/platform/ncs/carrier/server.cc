@@ -31,6 +31,7 @@
 #include "ncs/server.h"
 
 #include "ncs/frame.h"
+#include "ncs/guard.h"
 #include "ncs/net.h"
 #include "ncs/runtime.h"
 #include "ncs/tls.h"
@@ -858,39 +859,34 @@ extern "C" {
 void rpc__listen(const char *host, uint32_t port, uint32_t threads, socket__addr_t *bound, uint32_t *bound_len,
                  uint32_t *status)
 {
-    uint32_t result = rpc__s_ok;
-    try {
+    ncs::guarded(status, rpc__s_cant_listen, [&] {
         tcp::endpoint endpoint;
         std::lock_guard<std::mutex> hold(g_server_mutex);
         if (port > 65535 || g_server != nullptr)
-            result = rpc__s_cant_listen;
-        else if (!endpoint_for(host != nullptr ? host : "127.0.0.1", port, endpoint))
-            result = rpc__s_unknown_host;
-        if (result == rpc__s_ok) {
-            auto server = std::make_unique<Server>(std::min(threads > 0 ? threads : kDefaultThreads, kMaxThreads),
-                                                   Limits::from_environment());
-            result = server->listen(endpoint);
-            if (result == rpc__s_ok) {
-                server->start();
-                socket__addr_t addr;
-                uint32_t addr_len = ncs::net::address_of(server->local(), addr);
-                if (bound != nullptr)
-                    *bound = addr;
-                if (bound_len != nullptr)
-                    *bound_len = addr_len;
-                g_server = std::move(server);
-            }
-        }
-    } catch (const std::exception &) {
-        result = rpc__s_cant_listen;
-    }
-    if (status != nullptr)
-        *status = result;
+            return rpc__s_cant_listen;
+        if (!endpoint_for(host != nullptr ? host : "127.0.0.1", port, endpoint))
+            return rpc__s_unknown_host;
+        auto server = std::make_unique<Server>(std::min(threads > 0 ? threads : kDefaultThreads, kMaxThreads),
+                                               Limits::from_environment());
+        uint32_t result = server->listen(endpoint);
+        if (result != rpc__s_ok)
+            return result;
+        server->start();
+        socket__addr_t addr;
+        uint32_t addr_len = ncs::net::address_of(server->local(), addr);
+        if (bound != nullptr)
+            *bound = addr;
+        if (bound_len != nullptr)
+            *bound_len = addr_len;
+        g_server = std::move(server);
+        return rpc__s_ok;
+    });
 }
 
 void rpc__stop_listening(void)
 {
-    try {
+    // Only a failing lock or join can throw; the server is gone either way.
+    ncs::guarded(nullptr, rpc__s_ok, [] {
         std::unique_ptr<Server> server;
         {
             std::lock_guard<std::mutex> hold(g_server_mutex);
@@ -899,9 +895,8 @@ void rpc__stop_listening(void)
         // Stopped outside the lock: a call that runs to its end may still
         // ask for the counters.
         server.reset();
-    } catch (...) {
-        // Only a failing lock or join can throw; the server is gone either way.
-    }
+        return rpc__s_ok;
+    });
 }
 
 void rpc__inq_server_stats(rpc__server_stats_t *stats)
@@ -909,13 +904,13 @@ void rpc__inq_server_stats(rpc__server_stats_t *stats)
     if (stats == nullptr)
         return;
     *stats = rpc__server_stats_t{0, 0, 0};
-    try {
+    // A lock that can't be taken leaves the counters at 0.
+    ncs::guarded(nullptr, rpc__s_ok, [&] {
         std::lock_guard<std::mutex> hold(g_server_mutex);
         if (g_server != nullptr)
             *stats = g_server->stats();
-    } catch (...) {
-        // A lock that can't be taken leaves the counters at 0.
-    }
+        return rpc__s_ok;
+    });
 }
 
 }  // extern "C"

@@ -16,6 +16,7 @@
 // the frame has left, the request may have run: only an idempotent call is
 // repeated then, once, and only after a failure of a pooled connection (the
 // server may have closed it as idle). Time-outs are never repeated.
+#include "ncs/deadline.h"
 #include "ncs/frame.h"
 #include "ncs/net.h"
 #include "ncs/runtime.h"
@@ -202,23 +203,10 @@ private:
         return ec;
     }
 
-    // Starts one operation and runs it to its end or to the deadline.
     template <class Start>
     asio::error_code run(Clock::time_point deadline, Start start)
     {
-        std::optional<asio::error_code> result;
-        start([&result](const asio::error_code &ec, auto &&...) { result = ec; });
-        io_.restart();
-        io_.run_until(deadline);
-        if (!result) {
-            // Closing cancels the operation; its handler still has to run.
-            asio::error_code ignored;
-            socket_.close(ignored);
-            io_.restart();
-            io_.run();
-            return asio::error::timed_out;
-        }
-        return *result;
+        return ncs::run_until(io_, socket_, deadline, start);
     }
 
     asio::io_context io_{1};

@@ -1,6 +1,7 @@
 // TLS contexts of the carrier's two ends, and the names the client checks.
 #include "ncs/tls.h"
 
+#include "ncs/guard.h"
 #include "ncs/net.h"
 #include "ncs/runtime.h"
 #include "ncs/server.h"
@@ -250,24 +251,19 @@ extern "C" {
 void rpc__tls_server(const char *cert, const char *key, const char *ca, uint32_t *status)
 {
     TRC1_FUNCTION();
-    uint32_t result = rpc__s_ok;
-    try {
+    ncs::guarded(status, rpc__s_tls_settings, [&] {
         ncs::tls::Files files{cert != nullptr ? cert : "", key != nullptr ? key : "", ca != nullptr ? ca : ""};
         std::shared_ptr<ncs::tls::Context> context;
         std::string error;
         bool exposed = false;
         if (!files.off() && (context = ncs::tls::make_context(files, true, error, exposed)) == nullptr) {
             TRC1_ERROR_MSG("TLS settings of the server refused: %s", error.c_str());
-            result = exposed ? rpc__s_tls_key_exposed : rpc__s_tls_settings;
-        } else {
-            std::lock_guard<std::mutex> hold(ncs::tls::g_mutex);
-            ncs::tls::g_server = std::move(context);
+            return exposed ? rpc__s_tls_key_exposed : rpc__s_tls_settings;
         }
-    } catch (...) {
-        result = rpc__s_tls_settings;
-    }
-    if (status != nullptr)
-        *status = result;
+        std::lock_guard<std::mutex> hold(ncs::tls::g_mutex);
+        ncs::tls::g_server = std::move(context);
+        return rpc__s_ok;
+    });
 }
 
 }  // extern "C"

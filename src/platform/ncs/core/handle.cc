@@ -4,6 +4,7 @@
 // foreign pointer is told apart from a handle without reading through it.
 // A handle is a plain value (an address and whether it is bound): a duplicate
 // is a copy, and nothing ties it to the handle it came from.
+#include "ncs/guard.h"
 #include "ncs/runtime.h"
 
 #include <cstring>
@@ -51,11 +52,7 @@ HandleTable &table()
     return *instance;
 }
 
-void set_status(uint32_t *status, uint32_t value)
-{
-    if (status != nullptr)
-        *status = value;
-}
+using ncs::set_status;
 
 void point_at(ncs::Handle &handle, const socket__addr_t &addr, uint32_t addr_len)
 {

@@ -5,6 +5,7 @@
 // shared pointer. A dispatch takes its own reference before it runs the stub,
 // so an interface unregistered while its calls run is gone for new calls at
 // once, and the calls under way finish on the registration they started with.
+#include "ncs/guard.h"
 #include "ncs/runtime.h"
 
 #include <array>
@@ -76,11 +77,7 @@ Registry &registry()
     return *instance;
 }
 
-void set_status(uint32_t *status, uint32_t value)
-{
-    if (status != nullptr)
-        *status = value;
-}
+using ncs::set_status;
 
 // Gives back a reply packet that a stub took before it raised.
 void drop_reply(const ncs::Dispatched &outcome)
@@ -164,11 +161,7 @@ void rpc__register_mgr(const uuid__t *, const rpc__if_spec_t *ifspec, const rpc_
         set_status(status, rpc__s_unknown_if);
         return;
     }
-    try {
-        set_status(status, registry().add(*ifspec, server_epv, mgr_epv));
-    } catch (const std::bad_alloc &) {
-        set_status(status, rpc__s_no_memory);
-    }
+    ncs::guarded(status, rpc__s_no_memory, [&] { return registry().add(*ifspec, server_epv, mgr_epv); });
 }
 
 void rpc__register_busy_mgr(const rpc__if_spec_t *ifspec, const void *busy_mgr_epv, uint32_t *status)

@@ -1,4 +1,5 @@
 // Host names and socket addresses.
+#include "ncs/guard.h"
 #include "ncs/ncs.h"
 #include "ncs/runtime.h"
 
@@ -21,11 +22,7 @@ struct AddrinfoFree {
 };
 using AddrinfoList = std::unique_ptr<addrinfo, AddrinfoFree>;
 
-void set_status(uint32_t *status, uint32_t value)
-{
-    if (status != nullptr)
-        *status = value;
-}
+using ncs::set_status;
 
 // A host name or address literal holds letters, digits, '-', '.', '_', and
 // for IPv6 ':' and '%' (zone). Anything else can't name a host, and goes to no

@@ -29,6 +29,15 @@ typedef struct PLT1_LOCK {
  * variable is changed. */
 PLT1_API const char *PLT1_GetEnv(const char *name, const char *dflt);
 
+/* A whole number in `text`: decimal digits, or 0x and hexadecimal digits,
+ * with nothing before or after. 1 and the number in `*value` when it lies in
+ * min..max; else 0 and `*value` unchanged. */
+PLT1_API int PLT1_ParseNumber(const char *text, uint32_t min, uint32_t max, uint32_t *value);
+/* The environment variable `name` as PLT1_ParseNumber reads it; `dflt`
+ * when it is unset or holds anything else. The one parser of every number
+ * the platform's libraries read from the environment. */
+PLT1_API uint32_t PLT1_GetEnvNumber(const char *name, uint32_t min, uint32_t max, uint32_t dflt);
+
 /* Makes `lock` usable (again). REQUIRES: no thread holds or waits for it. */
 PLT1_API void PLT1_InitializeLock(PLT1_LOCK *lock);
 /* Ends `lock`; afterwards it is back in its initial, usable state.

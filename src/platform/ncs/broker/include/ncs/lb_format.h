@@ -36,6 +36,7 @@
 #define NCS_LB_FORMAT_H
 
 #include "ncs/lb.h"
+#include "ncs/wire.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -50,7 +51,7 @@ constexpr uint16_t kVersion = 1;
 enum class Kind : uint16_t { kRegister = 1, kUnregister = 2, kLookup = 3, kReply = 0x80 };
 
 constexpr size_t kHeaderSize = 12;
-constexpr size_t kUuidSize = 16;
+constexpr size_t kUuidSize = wire::kUuidSize;
 constexpr size_t kAddrSize = sizeof(socket__addr_t);
 constexpr size_t kEntrySize = 3 * kUuidSize + 4 + LB_ANNOTATION_LEN + 4 + kAddrSize;
 constexpr size_t kLookupSize = 3 * kUuidSize + 4 + 4;
@@ -100,13 +101,18 @@ public:
     void u8(uint8_t v) { out_[at_++] = v; }
     void u16(uint16_t v)
     {
-        u8(static_cast<uint8_t>(v >> 8));
-        u8(static_cast<uint8_t>(v));
+        wire::put16(out_.data() + at_, v);
+        at_ += 2;
     }
     void u32(uint32_t v)
     {
-        u16(static_cast<uint16_t>(v >> 16));
-        u16(static_cast<uint16_t>(v));
+        wire::put32(out_.data() + at_, v);
+        at_ += 4;
+    }
+    void uuid(const uuid__t &u)
+    {
+        wire::put_uuid(out_.data() + at_, u);
+        at_ += wire::kUuidSize;
     }
     void bytes(const void *p, size_t n)
     {
@@ -127,13 +133,18 @@ public:
     uint8_t u8() { return in_[at_++]; }
     uint16_t u16()
     {
-        uint16_t high = u8();
-        return static_cast<uint16_t>((high << 8) | u8());
+        at_ += 2;
+        return wire::get16(in_.data() + at_ - 2);
     }
     uint32_t u32()
     {
-        uint32_t high = u16();
-        return (high << 16) | u16();
+        at_ += 4;
+        return wire::get32(in_.data() + at_ - 4);
+    }
+    uuid__t uuid()
+    {
+        at_ += wire::kUuidSize;
+        return wire::get_uuid(in_.data() + at_ - wire::kUuidSize);
     }
     void bytes(void *p, size_t n)
     {
@@ -164,31 +175,12 @@ inline Header get_header(Reader &r)
     return h;
 }
 
-inline void put_uuid(Writer &w, const uuid__t &u)
-{
-    w.u32(u.time_high);
-    w.u16(u.time_low);
-    w.u16(u.reserved);
-    w.u8(u.family);
-    w.bytes(u.host, sizeof u.host);
-}
-
-inline uuid__t get_uuid(Reader &r)
-{
-    uuid__t u;
-    u.time_high = r.u32();
-    u.time_low = r.u16();
-    u.reserved = r.u16();
-    u.family = r.u8();
-    r.bytes(u.host, sizeof u.host);
-    return u;
-}
 
 inline void put_entry(Writer &w, const lb__entry_t &e)
 {
-    put_uuid(w, e.object);
-    put_uuid(w, e.obj_type);
-    put_uuid(w, e.obj_interface);
+    w.uuid(e.object);
+    w.uuid(e.obj_type);
+    w.uuid(e.obj_interface);
     w.u32(e.flags);
     w.bytes(e.annotation, LB_ANNOTATION_LEN);
     uint32_t len = e.saddr_len < kAddrSize ? e.saddr_len : kAddrSize;
@@ -202,9 +194,9 @@ inline void put_entry(Writer &w, const lb__entry_t &e)
 // False when the entry's address length is above kAddrSize.
 inline bool get_entry(Reader &r, lb__entry_t &e)
 {
-    e.object = get_uuid(r);
-    e.obj_type = get_uuid(r);
-    e.obj_interface = get_uuid(r);
+    e.object = r.uuid();
+    e.obj_type = r.uuid();
+    e.obj_interface = r.uuid();
     e.flags = r.u32();
     r.bytes(e.annotation, LB_ANNOTATION_LEN);
     e.annotation[LB_ANNOTATION_LEN - 1] = '\0';
@@ -216,9 +208,9 @@ inline bool get_entry(Reader &r, lb__entry_t &e)
 
 inline void put_query(Writer &w, const Query &q)
 {
-    put_uuid(w, q.object);
-    put_uuid(w, q.type);
-    put_uuid(w, q.interface);
+    w.uuid(q.object);
+    w.uuid(q.type);
+    w.uuid(q.interface);
     w.u32(q.position);
     w.u32(q.max_results);
 }
@@ -226,9 +218,9 @@ inline void put_query(Writer &w, const Query &q)
 inline Query get_query(Reader &r)
 {
     Query q;
-    q.object = get_uuid(r);
-    q.type = get_uuid(r);
-    q.interface = get_uuid(r);
+    q.object = r.uuid();
+    q.type = r.uuid();
+    q.interface = r.uuid();
     q.position = r.u32();
     q.max_results = r.u32();
     return q;

@@ -30,6 +30,7 @@
 #define NCS_FRAME_H
 
 #include "ncs/ncs.h"
+#include "ncs/wire.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -64,7 +65,7 @@ static_assert(kVersionOffset == kMagicOffset + 4 && kKindOffset == kVersionOffse
               kBodyLenOffset == kOpnumOffset + 4 && kFaultOffset == kBodyLenOffset + 4 &&
               kHeaderSize == kFaultOffset + 4,
               "the header's fields follow each other without gaps");
-static_assert(sizeof(uuid__t) == 16, "a UUID fills its 16 bytes of the header");
+static_assert(wire::kUuidSize == 16, "a UUID fills its 16 bytes of the header");
 
 struct Header {
     uint8_t kind = 0;
@@ -80,42 +81,19 @@ struct Header {
 
 using Bytes = unsigned char[kHeaderSize];
 
-inline void put16(unsigned char *p, uint16_t v)
-{
-    p[0] = static_cast<unsigned char>(v >> 8);
-    p[1] = static_cast<unsigned char>(v);
-}
-inline void put32(unsigned char *p, uint32_t v)
-{
-    put16(p, static_cast<uint16_t>(v >> 16));
-    put16(p + 2, static_cast<uint16_t>(v));
-}
-inline uint16_t get16(const unsigned char *p)
-{
-    return static_cast<uint16_t>((p[0] << 8) | p[1]);
-}
-inline uint32_t get32(const unsigned char *p)
-{
-    return (uint32_t{get16(p)} << 16) | get16(p + 2);
-}
-
 inline void encode(const Header &h, Bytes out)
 {
-    put32(out + kMagicOffset, kMagic);
-    put16(out + kVersionOffset, kVersion);
+    wire::put32(out + kMagicOffset, kMagic);
+    wire::put16(out + kVersionOffset, kVersion);
     out[kKindOffset] = h.kind;
     out[kFlagsOffset] = h.flags;
-    put32(out + kCallIdOffset, h.call_id);
-    put32(out + kDrepOffset, h.drep);
-    put32(out + kUuidOffset, h.if_id.time_high);
-    put16(out + kUuidOffset + 4, h.if_id.time_low);
-    put16(out + kUuidOffset + 6, h.if_id.reserved);
-    out[kUuidOffset + 8] = h.if_id.family;
-    std::memcpy(out + kUuidOffset + 9, h.if_id.host, sizeof h.if_id.host);
-    put32(out + kIfVersOffset, h.if_vers);
-    put32(out + kOpnumOffset, h.opnum);
-    put32(out + kBodyLenOffset, h.body_len);
-    put32(out + kFaultOffset, h.fault);
+    wire::put32(out + kCallIdOffset, h.call_id);
+    wire::put32(out + kDrepOffset, h.drep);
+    wire::put_uuid(out + kUuidOffset, h.if_id);
+    wire::put32(out + kIfVersOffset, h.if_vers);
+    wire::put32(out + kOpnumOffset, h.opnum);
+    wire::put32(out + kBodyLenOffset, h.body_len);
+    wire::put32(out + kFaultOffset, h.fault);
 }
 
 // Reads a header. False for a frame this format can't take: another magic
@@ -126,23 +104,19 @@ inline void encode(const Header &h, Bytes out)
 // rpc__s_too_big.
 inline bool decode(const Bytes in, Header &h)
 {
-    if (get32(in + kMagicOffset) != kMagic || get16(in + kVersionOffset) != kVersion)
+    if (wire::get32(in + kMagicOffset) != kMagic || wire::get16(in + kVersionOffset) != kVersion)
         return false;
     h.kind = in[kKindOffset];
     if (h.kind != kRequest && h.kind != kReply && h.kind != kFault)
         return false;
     h.flags = in[kFlagsOffset];
-    h.call_id = get32(in + kCallIdOffset);
-    h.drep = get32(in + kDrepOffset);
-    h.if_id.time_high = get32(in + kUuidOffset);
-    h.if_id.time_low = get16(in + kUuidOffset + 4);
-    h.if_id.reserved = get16(in + kUuidOffset + 6);
-    h.if_id.family = in[kUuidOffset + 8];
-    std::memcpy(h.if_id.host, in + kUuidOffset + 9, sizeof h.if_id.host);
-    h.if_vers = get32(in + kIfVersOffset);
-    h.opnum = get32(in + kOpnumOffset);
-    h.body_len = get32(in + kBodyLenOffset);
-    h.fault = get32(in + kFaultOffset);
+    h.call_id = wire::get32(in + kCallIdOffset);
+    h.drep = wire::get32(in + kDrepOffset);
+    h.if_id = wire::get_uuid(in + kUuidOffset);
+    h.if_vers = wire::get32(in + kIfVersOffset);
+    h.opnum = wire::get32(in + kOpnumOffset);
+    h.body_len = wire::get32(in + kBodyLenOffset);
+    h.fault = wire::get32(in + kFaultOffset);
     return h.kind != kFault || (h.body_len == 0 && h.fault != rpc__s_ok && h.fault != EXC1_FRAME_SET);
 }
 

@@ -38,6 +38,18 @@ inline tcp::endpoint endpoint_of(const socket__addr_t &addr)
     return endpoint;
 }
 
+// The endpoint of an address of `addr_len` bytes that a peer or a caller
+// gave, at `port`; false unless it is a whole IPv4 or IPv6 address.
+inline bool endpoint_from(const socket__addr_t &addr, uint32_t addr_len, uint16_t port, tcp::endpoint &endpoint)
+{
+    if (!(addr.sa.sa_family == AF_INET && addr_len >= sizeof addr.in4) &&
+        !(addr.sa.sa_family == AF_INET6 && addr_len >= sizeof addr.in6))
+        return false;
+    endpoint = endpoint_of(addr);
+    endpoint.port(port);
+    return true;
+}
+
 // The runtime's address of an endpoint; returns its length.
 inline uint32_t address_of(const tcp::endpoint &endpoint, socket__addr_t &addr)
 {

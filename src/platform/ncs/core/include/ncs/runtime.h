@@ -59,8 +59,8 @@ public:
 void *place_reply(uint32_t len, void *reply_buf, uint32_t reply_buf_size, Reply &reply);
 
 // A setting of the runtime from the environment variable `name`, read at
-// every call: a decimal number from 1 to 4294967295; `dflt` when the variable
-// is unset or holds anything else.
+// every call as PLT1_GetEnvNumber reads numbers: from 1 to 4294967295;
+// `dflt` when the variable is unset or holds anything else.
 uint32_t setting(const char *name, uint32_t dflt);
 
 // The carrier for the in-process family.
