@@ -100,19 +100,19 @@ void dpx_read_get_chunks_reply(ncs::ndr::Reader &reader, dpx_file_desc *desc, ui
     *crc = reader.get_u32();
     *state = reader.get_u8();
     *index = reader.get_u32();
-    const int16_t reply_last = reader.get_i16();
+    // The reply is read into the caller's arguments in the order of the body:
+    // a count the array can't take is found after `last` has been taken.
+    const int16_t reply_last = *last = reader.get_i16();
     *status = reader.get_u32();
     dpx_get_chunk_elements(reader, buffer, client_reply_count(reader, reply_last, max));
-    *last = reply_last;
 }
 
 void dpx_read_put_chunks_reply(ncs::ndr::Reader &reader, int16_t *last, int16_t max, dpx_status *status,
                                dpx_chunk buffer[])
 {
-    const int16_t reply_last = reader.get_i16();
+    const int16_t reply_last = *last = reader.get_i16();
     *status = reader.get_u32();
     dpx_get_chunk_elements(reader, buffer, client_reply_count(reader, reply_last, max));
-    *last = reply_last;
 }
 
 void dpx_read_agent_query_reply(ncs::ndr::Reader &reader, uint32_t *result, dpx_status *status)
@@ -124,10 +124,9 @@ void dpx_read_agent_query_reply(ncs::ndr::Reader &reader, uint32_t *result, dpx_
 void dpx_read_list_nodes_reply(ncs::ndr::Reader &reader, int16_t *last, int16_t max, dpx_status *status,
                                dpx_node_name nodes[])
 {
-    const int16_t reply_last = reader.get_i16();
+    const int16_t reply_last = *last = reader.get_i16();
     *status = reader.get_u32();
     dpx_get_node_elements(reader, nodes, client_reply_count(reader, reply_last, max));
-    *last = reply_last;
 }
 
 extern "C" {

@@ -355,8 +355,9 @@ TEST(Stubs, ServerStubsRefuseArraysWhoseWordsDisagreeWithMaxAndLastBeforeTheMana
     }
 }
 
-// The fields in front of the array are delivered; `last` and the array stay.
-TEST(Stubs, AClientStubRefusesAReplyCountAboveMaxOrOtherThanLastPlusOneAndKeepsLastAndArray)
+// The fields in front of the array are delivered, `last` among them, as the
+// reply is read in order; the array stays.
+TEST(Stubs, AClientStubRefusesAReplyCountAboveMaxOrOtherThanLastPlusOneAfterTakingLastAndKeepsTheArray)
 {
     const handle_t handle = peer();
     const std::pair<int16_t, uint16_t> rows[] = {{5, 6}, {1, 3}, {3, 2}, {-2, 0}};  // last, count word
@@ -365,7 +366,7 @@ TEST(Stubs, AClientStubRefusesAReplyCountAboveMaxOrOtherThanLastPlusOneAndKeepsL
         g_foreign_reply.emplace(encode(kGetChunksReply, reply, local_rep()), local_rep());
         Message args{.last = 0, .max = 3, .chunks = sample_chunks(4, 1)};
         EXPECT_EQ(raised_status([&] { client_call(DPX_OP_GET_CHUNKS, args, handle); }), DPX_RPC_FAULT_INVALID_BOUND);
-        EXPECT_TRUE(args == sized({.last = 0, .max = 3, .status = 9, .chunks = sample_chunks(4, 1)}));
+        EXPECT_TRUE(args == sized({.last = last, .max = 3, .status = 9, .chunks = sample_chunks(4, 1)}));
     }
     // The wire's size word is not what counts: the caller's max is.
     g_foreign_reply.emplace(encode(kListNodesReply, {.last = 1, .size_word = 0, .nodes = {{"a"}, {"b"}}}, local_rep()),
