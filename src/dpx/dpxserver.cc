@@ -7,6 +7,7 @@
 #include "plt/plt1.h"
 #include "trc/trc1.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 
@@ -199,18 +200,22 @@ namespace {
 
 // Reads one retry setting: the default when the variable is unset or holds no
 // number; a number as sscanf takes it otherwise (12x gives 12).
-template <class Value>
-void read_setting(const trc::Scope &scope, const char *variable, const char *format, Value *value, int32_t fallback)
+void read_setting(const trc::Scope &scope, const char *variable, int32_t *value, int32_t fallback)
 {
     const char *text = PLT1_GetEnv(variable, nullptr);
+    long long wide = 0;
     if (text == nullptr) {
         *value = fallback;
         if (scope.on(TRC1_FLOW))
             TRC1_Printf(scope.desc(), __LINE__, "No %s env", variable);
-    } else if (std::sscanf(text, format, value) != 1) {
+    } else if (std::sscanf(text, "%lld", &wide) != 1) {
         *value = fallback;
         if (scope.on(TRC1_FLOW))
             TRC1_Printf(scope.desc(), __LINE__, "Bad %s env: %s", variable, text);
+    } else {
+        // A long of the interface is 32 bits: its conversion gives the limit
+        // for a number beyond it.
+        *value = static_cast<int32_t>(std::clamp<long long>(wide, INT32_MIN, INT32_MAX));
     }
 }
 
@@ -225,12 +230,9 @@ uint32_t dpx_agent_init(void)
     PLT1_InitializeLock(&HUB_LOCK);
     uint32_t result = dpx_register_rpc_mgr();
 
-    read_setting(trc1_scope_, "DPX_MAX_RETRY", "%d", &MAX_DPX_RETRY, 6);
+    read_setting(trc1_scope_, "DPX_MAX_RETRY", &MAX_DPX_RETRY, 6);
     TRC1_FLOW_MSG("Set MAX_DPX_RETRY %d", MAX_DPX_RETRY);
-    // Parsed as a long and kept in 32 bits, as the setting is.
-    long interval = MIN_DPX_RETRY_INTERVAL;
-    read_setting(trc1_scope_, "DPX_MIN_RETRY_INTERVAL", "%ld", &interval, 3);
-    MIN_DPX_RETRY_INTERVAL = static_cast<int32_t>(interval);
+    read_setting(trc1_scope_, "DPX_MIN_RETRY_INTERVAL", &MIN_DPX_RETRY_INTERVAL, 3);
     TRC1_FLOW_MSG("Set MIN_DPX_RETRY_INTERVAL %d seconds", MIN_DPX_RETRY_INTERVAL);
     return result;
 }

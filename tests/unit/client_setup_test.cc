@@ -28,6 +28,10 @@ TEST(ClientSetup, TheStartReadsTheRetrySettingsFromTheEnvironment)
         {"12x", 12, 12, nullptr},
         {"0", 0, 0, nullptr},
         {"-1", -1, -1, nullptr},
+        // Beyond 32 bits, the conversion's limits, as a 32-bit long has them.
+        {"2147483648", INT32_MAX, INT32_MAX, nullptr},
+        {"-2147483649", INT32_MIN, INT32_MIN, nullptr},
+        {"99999999999999999999", INT32_MAX, INT32_MAX, nullptr},
     };
     for (const auto &c : cases) {
         SCOPED_TRACE(c.value.value_or("unset"));
