@@ -97,17 +97,21 @@ dpx_status start_transfer(const trc::Scope &scope, bool arguments_given, const c
 
 // Steps 5 to 7 of a download, on the present buffer: one call, the checksum
 // of what arrived against the service's, and the write to the local file.
-void fetch_buffer(handle_t handle, dpx_file_desc *desc, uint32_t *peer_crc, uint32_t *local_crc, uint8_t *state,
-                  uint32_t *index, int16_t *last, int16_t max, dpx_status *status, dpx_chunk *buffer,
-                  cx_os_file_t *file)
+// Traces with the loop's `scope`.
+void fetch_buffer(const trc::Scope &scope, handle_t handle, dpx_file_desc *desc, uint32_t *peer_crc,
+                  uint32_t *local_crc, uint8_t *state, uint32_t *index, int16_t *last, int16_t max,
+                  dpx_status *status, dpx_chunk *buffer, cx_os_file_t *file)
 {
     uint32_t index_before = *index;
     get_chunks(handle, desc, peer_crc, state, index, last, max, status, buffer);
     // A service that says more follows but delivered nothing would keep the
-    // loop going for ever.
+    // loop going for ever. The loop finds this itself, as it finds a damaged
+    // buffer, so the binding stays.
     if (*status == DPX_OK && *state == DPX_STATE_MORE && (*last < 0 || *index <= index_before)) {
         *status = DPX_E_RPC_FAILED;
-        invalidate_hub_handle();
+        if (scope.on(TRC1_ERROR))
+            TRC1_Printf(scope.desc(), __LINE__, "more follows, says the service, but index %u didn't move",
+                        index_before);
         return;
     }
     if (*status == DPX_OK) {
@@ -202,7 +206,8 @@ dpx_status download_file(const char *node, const char *path, cx_os_file_t *file)
     if (buffer == nullptr)
         status = DPX_E_NO_MEMORY;
     else
-        fetch_buffer(handle, &desc, &peer_crc, &local_crc, &state, &index, &last, max, &status, buffer, file);
+        fetch_buffer(trc1_scope_, handle, &desc, &peer_crc, &local_crc, &state, &index, &last, max, &status, buffer,
+                     file);
     dpx_free_xfer_buff(buffer);
 
     if (status == DPX_OK && state == DPX_STATE_MORE) {
@@ -212,7 +217,8 @@ dpx_status download_file(const char *node, const char *path, cx_os_file_t *file)
         if (buffer == nullptr)
             status = DPX_E_NO_MEMORY;
         while (buffer != nullptr && state == DPX_STATE_MORE && status == DPX_OK)
-            fetch_buffer(handle, &desc, &peer_crc, &local_crc, &state, &index, &last, max, &status, buffer, file);
+            fetch_buffer(trc1_scope_, handle, &desc, &peer_crc, &local_crc, &state, &index, &last, max, &status, buffer,
+                     file);
         dpx_free_xfer_buff(buffer);
     }
 

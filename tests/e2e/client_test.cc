@@ -66,6 +66,9 @@ TEST(Client, AFileJustAbove4GiBMakesTheRoundTrip)
     EXPECT_TRUE(same_files(source, target));
 }
 
+// A failure that the transfer loop finds itself (a damaged buffer, a service
+// that says more follows and delivers nothing) leaves the binding; one that
+// a reply carries drops it.
 TEST(Client, AGetReplacesItsTargetWholeOnSuccessOnlyAndLeavesNoTemporaryFile)
 {
     const struct {
@@ -73,12 +76,14 @@ TEST(Client, AGetReplacesItsTargetWholeOnSuccessOnlyAndLeavesNoTemporaryFile)
         std::vector<std::string> peer_args;
         bool remote_exists, hub_down;
         dpx_status expected;
+        bool binding_kept;
     } cases[] = {
-        {"success", "dpx-agentd", {}, true, false, DPX_OK},
-        {"missing remote file", "dpx-agentd", {}, false, false, DPX_E_FILE_READ},
-        {"hub down: no binding", "dpx-agentd", {}, true, true, DPX_E_INVALID_PARAM},
-        {"file changed", "dpx_test_peer", {"--grow-after-get", "1"}, true, false, DPX_E_FILE_CHANGED},
-        {"checksum failure", "dpx_test_peer", {"--corrupt-get", "2"}, true, false, DPX_E_CHECKSUM},
+        {"success", "dpx-agentd", {}, true, false, DPX_OK, true},
+        {"missing remote file", "dpx-agentd", {}, false, false, DPX_E_FILE_READ, false},
+        {"hub down: no binding", "dpx-agentd", {}, true, true, DPX_E_INVALID_PARAM, false},
+        {"file changed", "dpx_test_peer", {"--grow-after-get", "1"}, true, false, DPX_E_FILE_CHANGED, false},
+        {"checksum failure", "dpx_test_peer", {"--corrupt-get", "2"}, true, false, DPX_E_CHECKSUM, true},
+        {"more without moving", "dpx_test_peer", {"--stall-get", "2"}, true, false, DPX_E_RPC_FAILED, true},
     };
     for (const auto &c : cases) {
         SCOPED_TRACE(c.what);
@@ -90,9 +95,12 @@ TEST(Client, AGetReplacesItsTargetWholeOnSuccessOnlyAndLeavesNoTemporaryFile)
         if (c.hub_down)
             hub.stop();
 
+        TraceCapture trace(TRC1_ERROR);
         EXPECT_EQ(GetFile("node1", "remote.bin", (hub / "target.bin").c_str()), c.expected);
         EXPECT_TRUE(read_file(hub / "target.bin") == (c.expected == DPX_OK ? content : old_content));
         EXPECT_TRUE(hub.temp_files().empty());
+        EXPECT_EQ(BINDING_HANDLE_INVALID == 0, c.binding_kept);
+        EXPECT_TRUE(c.expected != DPX_E_RPC_FAILED || trace.contains("more follows")) << trace.text();
     }
 }
 

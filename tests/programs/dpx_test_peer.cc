@@ -1,11 +1,13 @@
 // A hub for tests: the library's own managers, but answering as peers outside
 // this library may: busy K times, quiet, with node names or a query result of
-// its own, with a damaged checksum on the Nth get_chunks, or with the file
-// grown after the Nth. Prints "listening on HOST:PORT", then a line per call:
+// its own, with a damaged checksum on the Nth get_chunks, with the file
+// grown after the Nth, or saying on the Nth that more follows without
+// delivering any. Prints "listening on HOST:PORT", then a line per call:
 // "call OP 0xSTATUS", agent_query first "query node=NODE".
 //
 // usage: dpx_test_peer [--depot DIR] [--product NAME] [--hub] [--broker] [--busy K]
 //            [--quiet] [--nodes A,B,C] [--query-result N] [--corrupt-get N] [--grow-after-get N]
+//            [--stall-get N]
 #include "dpx/dpx.h"
 
 #include "afw/afw.h"
@@ -32,7 +34,7 @@ std::atomic<int> g_busy_left{0}, g_get_calls{0};
 bool g_quiet = false;
 std::optional<std::vector<std::string>> g_nodes;
 std::optional<uint32_t> g_query_result;
-int g_corrupt_call = 0, g_grow_call = 0;
+int g_corrupt_call = 0, g_grow_call = 0, g_stall_call = 0;
 std::mutex g_out;
 
 void report(const char *op, dpx_status status)
@@ -55,8 +57,14 @@ void peer_get_chunks(handle_t h, dpx_file_desc *desc, uint32_t *crc, uint8_t *st
                      int16_t max, dpx_status *status, dpx_chunk buffer[])
 {
     if (!answered_by_rule(status)) {
+        const uint32_t asked = *index;
         dpx_get_chunks(h, desc, crc, state, index, last, max, status, buffer);
         int call = ++g_get_calls;
+        if (call == g_stall_call) {
+            *state = DPX_STATE_MORE;
+            *index = asked;
+            *last = -1;
+        }
         char full[DPX_PATH_LEN];
         if (call == g_corrupt_call)
             *crc ^= 0x5A5A5A5A;
@@ -131,6 +139,8 @@ int main(int argc, char **argv)
             g_corrupt_call = std::atoi(value.c_str());
         else if (arg == "--grow-after-get")
             g_grow_call = std::atoi(value.c_str());
+        else if (arg == "--stall-get")
+            g_stall_call = std::atoi(value.c_str());
         else if (arg == "--query-result")
             g_query_result = static_cast<uint32_t>(std::strtoul(value.c_str(), nullptr, 0));
         else if (arg == "--nodes")
